@@ -1,0 +1,8 @@
+add_compile_options(-Wall -Wextra)
+if(ZEPA_WERROR)
+  add_compile_options(-Werror)
+endif()
+if(ZEPA_SANITIZE)
+  add_compile_options(-fsanitize=address,undefined -fno-sanitize-recover=undefined -fno-omit-frame-pointer)
+  add_link_options(-fsanitize=address,undefined)
+endif()

@@ -1,0 +1,85 @@
+// One HTTP(S) GET or POST over a libcurl easy handle, sharing cookies and the
+// DNS cache with every other request of the process. Single-threaded.
+#ifndef ZEPARELAYD_REQUEST_H
+#define ZEPARELAYD_REQUEST_H
+
+#include <curl/curl.h>
+#include <json/value.h>
+
+#include <list>
+#include <string>
+
+#include <zeparelayd/errors.h>
+#include <zeparelayd/export.h>
+
+namespace ZEPA {
+namespace Relay {
+
+class ZEPARELAYD_API Request {
+public:
+    Request(const char* url, const char* data, bool post);
+    Request(const std::string& url, const Json::Value& data, bool post);
+    Request(const Request& other);
+    // Does not free the handle held before: only assign to a request without one.
+    Request& operator=(const Request& other);
+    ~Request();
+
+    // Find the request that owns a finished easy handle of a multi loop.
+    bool operator==(const void* handle) const;
+    bool operator!=(const void* handle) const;
+
+    bool IsValid() const;
+    const std::string& GetUrl() const;
+    const std::string& GetData() const;
+    bool GetData(Json::Value& out) const;
+    CURLcode GetCurlResult() const;
+
+    // Payload and set-up.
+    bool Set(const std::string& url, const std::string& data, bool post);
+    bool Set(const std::string& url, const Json::Value& data, bool post);
+    bool SetData(const std::string& data, bool post);
+    bool SetData(const Json::Value& data, bool post);
+
+    // Transfer.
+    bool InitSend();
+    bool Send();
+    bool JobAdd(void* multi);
+    bool JobDone(CURLcode code);
+    bool JobRemove(void* multi);
+    int GetHttpStatus();
+    std::string GetResponse() const;
+    bool GetResponse(Json::Value& out) const;
+    RELAYD_RET GetError() const;
+    bool SetTcpKeepAlive(int seconds);
+    bool Write(Json::Value& out) const;
+
+    // Process-wide cookie and DNS state.
+    static CURLSH* GetCurlShare(bool renew);
+    static bool CleanDnsCache();
+    static std::string& GetCookie();
+    static bool SetCookie(const std::string& cookie);
+    bool GetCookies(std::list<std::string>& out) const;
+    bool SaveCookies();
+
+    static std::string _strCookie;
+    static CURLSH* _share;
+    // Set whenever the share handle is discarded; read by the daemon program.
+    static bool blForbidConnReuse;
+
+private:
+    std::list<std::string> _cookies;
+    std::string _url;
+    std::string _data;
+    std::string _response;
+    CURL* _curl;
+    CURLcode _curlResult;
+    char _errorBuffer[CURL_ERROR_SIZE];
+    bool _async;
+    bool _done;
+    long _httpStatus;
+};
+
+}  // namespace Relay
+}  // namespace ZEPA
+
+#endif

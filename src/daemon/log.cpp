@@ -1,0 +1,86 @@
+// Logging statics of Daemon: one line per message on standard error, which
+// points at the log file once the process is a daemon.
+#define ZEPA_LOG_SOURCE "daemon"
+
+#include <fcntl.h>
+#include <libdaemon/dlog.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstdio>
+#include <cstring>
+#include <ctime>
+
+#include "common/log.h"
+#include "common/paths.h"
+#include "daemon/log_seam.h"
+
+namespace ZEPA {
+namespace Relay {
+
+int Daemon::_logLevel = 4;
+std::string Daemon::_strLogFile;
+
+// Seam for the time-stamp conversion, so that a failing ctime_r can be shown.
+char* (*g_logCtime)(const time_t*, char*) = ctime_r;
+
+bool Daemon::IsLogEnable(int level) { return _logLevel >= level; }
+
+void Daemon::Log(int level, const char* format, ...) {
+    va_list args;
+    va_start(args, format);
+    LogV(level, format, args);
+    va_end(args);
+}
+
+void Daemon::LogV(int level, const char* format, va_list args) {
+    int savedErrno = errno;
+    if (!IsLogEnable(level)) {
+        errno = savedErrno;
+        return;
+    }
+    char stamp[32];
+    memset(stamp, 0, sizeof(stamp));
+    time_t now = time(nullptr);
+    if (g_logCtime(&now, stamp) != nullptr) {
+        size_t len = strlen(stamp);
+        if (len > 0 && stamp[len - 1] == '\n') stamp[len - 1] = '\0';
+        fprintf(stderr, "%s ", stamp);
+    }
+    vfprintf(stderr, format, args);
+    fputc('\n', stderr);
+    errno = savedErrno;
+}
+
+bool Daemon::OpenLogFile(const std::string& path, int fd, int flags) {
+    int newFd = open(path.c_str(), flags | O_WRONLY, 0600);
+    if (newFd < 0) {
+        ZLOG(ZEPA_LOG_ERR, "open log file [%s] failed", path.c_str());
+        return false;
+    }
+    if (newFd == fd) return true;
+    bool ok = true;
+    if (dup2(newFd, fd) < 0) {
+        ZLOG(ZEPA_LOG_ERR, "dup fd failed");
+        ok = false;
+    }
+    close(newFd);
+    return ok;
+}
+
+bool Daemon::SetLogFile(const std::string& path, int level) {
+    if (level >= 0) {
+        _logLevel = level;
+        daemon_set_verbosity(level);
+    }
+    _strLogFile = path;
+    if (!IsForked()) return true;
+    // After daemonising an empty path falls back to the default file, unlike
+    // the daemonising step itself, which then leaves stderr on /dev/null.
+    const std::string target = _strLogFile.empty() ? Paths::Resolve(Paths::DEFAULT_LOG_FILE) : _strLogFile;
+    OpenLogFile(target, STDERR_FILENO, O_CREAT | O_APPEND);
+    return true;
+}
+
+}  // namespace Relay
+}  // namespace ZEPA

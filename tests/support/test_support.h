@@ -1,0 +1,89 @@
+// Test support: a private system root per test, standard-error capture and
+// small file helpers. Every test owns its root and removes it afterwards.
+#ifndef ZEPARELAYD_TESTS_SUPPORT_TEST_SUPPORT_H
+#define ZEPARELAYD_TESTS_SUPPORT_TEST_SUPPORT_H
+
+#include <gtest/gtest.h>
+#include <json/value.h>
+#include <sys/types.h>
+
+#include <string>
+#include <vector>
+
+namespace zepatest {
+
+// A fresh temporary directory made the process's system root; removed (and
+// the root reset to "/") on destruction.
+class TempRoot {
+public:
+    TempRoot();
+    ~TempRoot();
+    TempRoot(const TempRoot&) = delete;
+    TempRoot& operator=(const TempRoot&) = delete;
+
+    const std::string& dir() const { return _dir; }
+    // dir() + absPath ("/etc/zepainfo.conf" -> "<dir>/etc/zepainfo.conf").
+    std::string path(const std::string& absPath) const;
+    // Writes a file below the root, creating parent folders.
+    void write(const std::string& absPath, const std::string& content, mode_t mode = 0644) const;
+    std::string read(const std::string& absPath) const;
+    bool exists(const std::string& absPath) const;
+    void mkdir(const std::string& absPath) const;
+
+private:
+    std::string _dir;
+};
+
+// Captures everything written to descriptor 2 between construction and stop().
+class StderrCapture {
+public:
+    StderrCapture();
+    ~StderrCapture();
+    std::string stop();
+
+private:
+    int _saved;
+    std::string _file;
+    bool _stopped;
+};
+
+// Captures descriptor 1 likewise.
+class StdoutCapture {
+public:
+    StdoutCapture();
+    ~StdoutCapture();
+    std::string stop();
+
+private:
+    int _saved;
+    std::string _file;
+    bool _stopped;
+};
+
+// Splits captured log output into messages with the 24-character time stamp
+// and its blank removed.
+std::vector<std::string> LogMessages(const std::string& captured);
+// True when some message of the captured log contains needle.
+bool LogContains(const std::string& captured, const std::string& needle);
+
+// Plain file helpers on real paths.
+std::string ReadFile(const std::string& path);
+void WriteFile(const std::string& path, const std::string& content, mode_t mode = 0644);
+bool FileExists(const std::string& path);
+void MakeDirs(const std::string& path);
+mode_t FileMode(const std::string& path);
+Json::Value ParseJson(const std::string& text);
+std::string ToJson(const Json::Value& value);
+
+// Base fixture: a private root and the library's logging statics at their
+// initial values.
+class RootTest : public ::testing::Test {
+protected:
+    void SetUp() override;
+    void TearDown() override;
+    TempRoot root;
+};
+
+}  // namespace zepatest
+
+#endif
