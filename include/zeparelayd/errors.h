@@ -12,9 +12,9 @@
 namespace ZEPA {
 namespace Relay {
 
-// Result of a relay operation ("error" in the status file). 1, 2 and 4 are
+// Result of a relay operation ("error" in the status file), any int. 1, 2 and 4 are
 // deliberately unassigned.
-enum RELAYD_RET {
+enum RELAYD_RET : int {
     RELAYD_SUCCESS = 0,
     RELAYD_ERR_CONFIG = 3,
     RELAYD_ERR_REGISTER = 5,
@@ -44,7 +44,8 @@ enum RELAYD_STATE : unsigned int {
 };
 
 // "errno" of a relay server answer. 12 is not assigned and must stay skipped.
-enum RELAYSERVER_ERR {
+// A fixed underlying type: answers may carry numbers outside the list.
+enum RELAYSERVER_ERR : int {
     RELAYSERVER_ERR_SUCCESS = 0,
     RELAYSERVER_ERR_UNKNOWN = 1,
     RELAYSERVER_ERR_AUTH = 2,
