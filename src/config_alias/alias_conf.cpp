@@ -18,7 +18,8 @@ const int AliasConf::DEFAULT_POLL_SECONDS;
 namespace {
 
 std::string StringMember(const Json::Value& section, const char* key) {
-    if (section.isObject() && section.isMember(key) && section[key].isString()) return section[key].asString();
+    if (section.isObject() && section.isMember(key) && section[key].isString())
+        return section[key].asString();
     return std::string();
 }
 

@@ -17,7 +17,8 @@ class AliasConfTest : public zepatest::RootTest {};
 
 AliasConf Configured() {
     AliasConf conf;
-    conf.Overwrite(ParseJson("{\"alias\":\"box\",\"url\":\"https://alias.example.net\",\"poll_seconds\":600}"));
+    conf.Overwrite(
+        ParseJson("{\"alias\":\"box\",\"url\":\"https://alias.example.net\",\"poll_seconds\":600}"));
     return conf;
 }
 
@@ -107,7 +108,8 @@ TEST_F(AliasConfTest, CompactWriteAddsNonDefaults) {
     AliasConf conf = Configured();
     Json::Value out;
     conf.Write(out, true);
-    EXPECT_EQ(ParseJson("{\"alias\":\"box\",\"url\":\"https://alias.example.net\",\"poll_seconds\":600}"), out);
+    EXPECT_EQ(ParseJson("{\"alias\":\"box\",\"url\":\"https://alias.example.net\",\"poll_seconds\":600}"),
+              out);
 }
 
 TEST_F(AliasConfTest, FullWriteHasEveryKey) {

@@ -163,7 +163,7 @@ TEST_F(AliasStatusTest, SetStatusReplacesBrokenDocument) {
 }
 
 TEST_F(AliasStatusTest, CorruptFileIsRenamedAndReadsAsNothing) {
-    root.write(STATUS, "{\"alias_name\":\"box\"");
+    root.write(STATUS, "alias_name=box");
     AliasStatus st;
     EXPECT_TRUE(root.exists(std::string(STATUS) + ".bad"));
     std::string status = "s0", extra;

@@ -75,7 +75,8 @@ TEST_F(ServerConfTest, FullFormOfDefaultSectionHasAllKeysInOrder) {
     EXPECT_EQ("Serv.php", out["page"].asString());
     std::ostringstream os;
     os << conf;
-    EXPECT_EQ("{\"host\":\"\",\"ip\":\"\",\"page\":\"Serv.php\",\"port\":80,\"protocol\":\"http\"}\n", os.str());
+    EXPECT_EQ("{\"host\":\"\",\"ip\":\"\",\"page\":\"Serv.php\",\"port\":80,\"protocol\":\"http\"}\n",
+              os.str());
 }
 
 TEST_F(ServerConfTest, PersistentFormWithHostHasOnlyHost) {
@@ -135,8 +136,9 @@ TEST_F(ServerConfTest, FullRoundTripKeepsEverything) {
 
 TEST_F(ServerConfTest, OverwriteTakesKeysOfExpectedType) {
     ServerConf conf(nullptr, nullptr);
-    EXPECT_TRUE(conf.Overwrite(ParseJson(
-        "{\"protocol\":\"https\",\"host\":\"h.example\",\"ip\":\"192.0.2.3\",\"port\":443,\"page\":\"p.php\"}")));
+    EXPECT_TRUE(
+        conf.Overwrite(ParseJson("{\"protocol\":\"https\",\"host\":\"h.example\",\"ip\":\"192.0.2.3\","
+                                 "\"port\":443,\"page\":\"p.php\"}")));
     EXPECT_EQ("https", conf.protocol);
     EXPECT_EQ("h.example", conf.host);
     EXPECT_EQ("192.0.2.3", conf.ip);
@@ -251,7 +253,7 @@ TEST_F(ServerConfTest, EnvConfNonStringRegionIsIgnored) {
 }
 
 TEST_F(ServerConfTest, CorruptEnvConfKeepsHostRegionAndIsRenamed) {
-    root.write("/usr/zepa/etc/zeparelayd/env.conf", "{\"relay_region\": \"eu\"");
+    root.write("/usr/zepa/etc/zeparelayd/env.conf", "relay_region=eu");
     EXPECT_EQ("ab", ServerConf("ab1.x.y", nullptr).GetRegion());
     EXPECT_FALSE(root.exists("/usr/zepa/etc/zeparelayd/env.conf"));
     EXPECT_TRUE(root.exists("/usr/zepa/etc/zeparelayd/env.conf.bad"));
