@@ -1,0 +1,189 @@
+// The pass file: its layout, its mode before the secret, its failures, and
+// the user names that must never place it outside the temporary folder.
+#include <errno.h>
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <string>
+#include <vector>
+
+#include <zeparelayd/daemon.h>
+#include <zeparelayd/tunnel.h>
+
+#include "tunnel/tunnel_seam.h"
+#include "tunnel_fixture.h"
+
+using namespace ZEPA::Relay;
+using namespace tunneltest;
+
+namespace {
+
+// What the recording file calls saw, in order.
+std::vector<std::string> g_calls;
+int g_openedFd = -1;
+int g_failFchmod = 0;
+int g_failWrite = 0;
+
+int RecordOpen(const char* path, int flags, mode_t mode) {
+    g_openedFd = open(path, flags, mode);
+    g_calls.push_back("open");
+    return g_openedFd;
+}
+
+int RecordFchmod(int fd, mode_t mode) {
+    g_calls.push_back(std::string("fchmod ") + (fd == g_openedFd ? "same-fd " : "other-fd ") +
+                      std::to_string(mode));
+    if (g_failFchmod) {
+        errno = g_failFchmod;
+        return -1;
+    }
+    return fchmod(fd, mode);
+}
+
+ssize_t RecordWrite(int fd, const void* buf, size_t count) {
+    struct stat st;
+    fstat(fd, &st);
+    g_calls.push_back(std::string("write ") + (fd == g_openedFd ? "same-fd " : "other-fd ") + "mode " +
+                      std::to_string(st.st_mode & 07777) + " size-before " + std::to_string(st.st_size));
+    if (g_failWrite) {
+        errno = g_failWrite;
+        return -1;
+    }
+    return write(fd, buf, count);
+}
+
+class TunnelPassFile : public TunnelTest {
+protected:
+    void SetUp() override {
+        TunnelTest::SetUp();
+        saved = g_tunnelFileOps;
+        g_calls.clear();
+        g_failFchmod = g_failWrite = 0;
+    }
+    void TearDown() override {
+        g_tunnelFileOps = saved;
+        TunnelTest::TearDown();
+    }
+    void Record() { g_tunnelFileOps = {RecordOpen, RecordFchmod, RecordWrite}; }
+    TunnelFileOps saved;
+};
+
+TEST_F(TunnelPassFile, TwoLinesWithoutTrailingNewline) {
+    Tunnel tunnel = MakeTunnel();
+    ASSERT_TRUE(tunnel.WritePassFile(PassPath()));
+    EXPECT_EQ("relayuser\ns3cret-pass", zepatest::ReadFile(PassPath()));
+    EXPECT_EQ(0600u, zepatest::FileMode(PassPath()));
+}
+
+TEST_F(TunnelPassFile, ModeIsNarrowedOnTheOpenFileBeforeAnyByte) {
+    // A leftover file keeps its wide mode through open; only fchmod narrows it.
+    root.write("/tmp/.tunnel.relayuser", "leftover", 0666);
+    Record();
+    Tunnel tunnel = MakeTunnel();
+    ASSERT_TRUE(tunnel.WritePassFile(PassPath()));
+
+    ASSERT_GE(g_calls.size(), 3u);
+    EXPECT_EQ("open", g_calls[0]);
+    EXPECT_EQ("fchmod same-fd 384", g_calls[1]);  // 0600
+    EXPECT_EQ("write same-fd mode 384 size-before 0", g_calls[2]);
+    EXPECT_EQ(0600u, zepatest::FileMode(PassPath()));
+    EXPECT_EQ("relayuser\ns3cret-pass", zepatest::ReadFile(PassPath()));
+}
+
+TEST_F(TunnelPassFile, FailedChmodWritesNothingAndRemovesTheFile) {
+    Record();
+    g_failFchmod = EPERM;
+    Tunnel tunnel = MakeTunnel();
+    zepatest::StderrCapture capture;
+    EXPECT_FALSE(tunnel.WritePassFile(PassPath()));
+    const std::string log = capture.stop();
+
+    EXPECT_TRUE(zepatest::LogContains(log, "chmod [" + PassPath() + "] failed, Operation not permitted"))
+        << log;
+    EXPECT_EQ(2u, g_calls.size());
+    EXPECT_FALSE(zepatest::FileExists(PassPath()));
+}
+
+TEST_F(TunnelPassFile, FailedWriteRemovesTheFile) {
+    Record();
+    g_failWrite = ENOSPC;
+    Tunnel tunnel = MakeTunnel();
+    zepatest::StderrCapture capture;
+    EXPECT_FALSE(tunnel.WritePassFile(PassPath()));
+    const std::string log = capture.stop();
+
+    EXPECT_TRUE(zepatest::LogContains(log, "write pass failed, No space left on device")) << log;
+    EXPECT_FALSE(zepatest::FileExists(PassPath()));
+    EXPECT_EQ(std::string::npos, log.find("s3cret-pass"));
+}
+
+TEST_F(TunnelPassFile, FailedWriteStartsNoChild) {
+    Record();
+    g_failWrite = EIO;
+    Tunnel tunnel = MakeTunnel();
+    EXPECT_FALSE(tunnel.Create(true));
+    EXPECT_FALSE(Called(1));
+    EXPECT_TRUE(ShellCommands().empty());
+    EXPECT_EQ(TUNNEL_STATUS_FAILED, tunnel.GetStatus());
+    EXPECT_FALSE(zepatest::FileExists(PassPath()));
+}
+
+TEST_F(TunnelPassFile, LongContentIsCutAt1023Bytes) {
+    Tunnel tunnel = MakeTunnel();
+    tunnel.relay_pass = std::string(2000, 'p');
+    ASSERT_TRUE(tunnel.WritePassFile(PassPath()));
+    const std::string content = zepatest::ReadFile(PassPath());
+    EXPECT_EQ(1023u, content.size());
+    EXPECT_EQ(0u, content.find("relayuser\npppp"));
+}
+
+TEST_F(TunnelPassFile, PlantedLinkIsNotWrittenThrough) {
+    root.write("/etc/victim", "keep me", 0644);
+    ASSERT_EQ(0, symlink(root.path("/etc/victim").c_str(), PassPath().c_str()));
+    Tunnel tunnel = MakeTunnel();
+    zepatest::StderrCapture capture;
+    EXPECT_FALSE(tunnel.RunVPNTunnel("udp"));
+    const std::string log = capture.stop();
+
+    EXPECT_EQ("keep me", root.read("/etc/victim"));
+    EXPECT_EQ(0644u, zepatest::FileMode(root.path("/etc/victim")));
+    EXPECT_TRUE(zepatest::LogContains(log, "open [" + PassPath() + "] failed")) << log;
+    EXPECT_FALSE(Called(1));
+    struct stat st;
+    EXPECT_NE(0, lstat(PassPath().c_str(), &st));
+}
+
+TEST_F(TunnelPassFile, UnsafeUserNameIsRefusedBeforeAnyFile) {
+    root.mkdir("/etc");
+    for (const char* user : {"../etc/evil", "../../../../../../tmp/x", "a/b", "..", "x\ny"}) {
+        Tunnel tunnel = MakeTunnel(user);
+        zepatest::StderrCapture capture;
+        EXPECT_FALSE(tunnel.RunVPNTunnel("tcp")) << user;
+        EXPECT_FALSE(tunnel.Create(true)) << user;
+        const std::string log = capture.stop();
+        EXPECT_TRUE(zepatest::LogContains(log, "unsafe tunnel user name refused")) << user;
+        EXPECT_EQ(-1, tunnel.pid);
+    }
+    EXPECT_FALSE(root.exists("/etc/evil"));
+    EXPECT_FALSE(zepatest::FileExists(root.path("/tmp/.tunnel.a")));
+    EXPECT_FALSE(Called(1));
+    EXPECT_TRUE(ShellCommands().empty());
+}
+
+TEST_F(TunnelPassFile, SectionWithoutPasswordStartsNothing) {
+    Tunnel tunnel(zepatest::ParseJson(R"({"relay_ip":"192.0.2.10","relay_user":"relayuser"})"));
+    Daemon::_logLevel = 7;
+    zepatest::StderrCapture capture;
+    EXPECT_FALSE(tunnel.Create(true));
+    const std::string log = capture.stop();
+
+    EXPECT_TRUE(zepatest::LogContains(log, "invalid tunnel server info")) << log;
+    EXPECT_EQ(TUNNEL_STATUS_NONE, tunnel.GetStatus());
+    EXPECT_EQ(-1, tunnel.pid);
+    EXPECT_FALSE(Called(1));
+    EXPECT_TRUE(ShellCommands().empty());
+    EXPECT_FALSE(zepatest::FileExists(PassPath()));
+}
+
+}  // namespace
