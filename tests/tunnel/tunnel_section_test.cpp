@@ -1,4 +1,6 @@
 // The tunnel as a configuration section: reading, checking, writing, words.
+#include <sstream>
+
 #include <zeparelayd/daemon.h>
 #include <zeparelayd/tunnel.h>
 
@@ -173,6 +175,31 @@ TEST(TunnelWrite, UnknownStatusIsWrittenAsItsWord) {
     Json::Value out;
     tunnel.Write(out, true);
     EXPECT_EQ("(unknown)", out["status"].asString());
+}
+
+TEST(TunnelWrite, PrintedSectionIsTheFullFormWithoutPassword) {
+    Tunnel tunnel(FullSection());
+    std::ostringstream printed;
+    printed << static_cast<const Config&>(tunnel);
+    EXPECT_EQ(ParseJson(R"({"relay_ip":"192.0.2.10","relay_user":"relayuser","status":"NONE","pid":-1})"),
+              ParseJson(printed.str()));
+    EXPECT_EQ(std::string::npos, printed.str().find("s3cret-pass"));
+}
+
+TEST(TunnelWrite, WrittenFormReadsBackWithoutTheSecret) {
+    Tunnel tunnel(FullSection());
+    Json::Value full;
+    tunnel.Write(full, true);
+    Tunnel back(full);
+    EXPECT_EQ(tunnel.relay_ip, back.relay_ip);
+    EXPECT_EQ(tunnel.relay_user, back.relay_user);
+    // The password has to come from a new server answer.
+    EXPECT_EQ("", back.relay_pass);
+    EXPECT_FALSE(back.IsValid());
+
+    Json::Value persistent;
+    tunnel.Write(persistent, false);
+    EXPECT_EQ("192.0.2.10", Tunnel(persistent).GetHost());
 }
 
 }  // namespace

@@ -79,6 +79,17 @@ TEST_F(TunnelStart, UdpComesUpFirstTime) {
     EXPECT_EQ(0, g_sigalrm);
 }
 
+TEST_F(TunnelStart, StartedTunnelWritesItsStateAndPid) {
+    Tunnel tunnel = MakeTunnel();
+    ASSERT_TRUE(tunnel.Create(true));
+    children.push_back(tunnel.pid);
+    Json::Value out;
+    tunnel.Write(out, true);
+    EXPECT_EQ("READY", out["status"].asString());
+    EXPECT_EQ(tunnel.pid, out["pid"].asInt());
+    EXPECT_FALSE(out.isMember("relay_pass"));
+}
+
 TEST_F(TunnelStart, UdpFailureFallsBackToTcp) {
     SetBehaviour("udp", "exit");
     Tunnel tunnel = MakeTunnel();
