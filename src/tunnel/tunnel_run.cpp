@@ -76,12 +76,34 @@ private:
     sigset_t _saved;
 };
 
-void ReapDeadChildren() {
+enum class Reaped { NONE, OTHERS_ONLY, OURS };
+
+// Reaps every dead child without blocking, so that a dead VPN child no longer
+// looks alive to kill(pid, 0).
+Reaped ReapDeadChildren(pid_t ours) {
+    Reaped result = Reaped::NONE;
     for (;;) {
         pid_t reaped = waitpid(-1, nullptr, WNOHANG);
-        if (reaped > 0) continue;
         if (reaped < 0 && errno == EINTR) continue;
-        return;
+        if (reaped <= 0) return result;
+        if (reaped == ours)
+            result = Reaped::OURS;
+        else if (result == Reaped::NONE)
+            result = Reaped::OTHERS_ONLY;
+    }
+}
+
+// Suspends until the child dies, the up script signals, the alarm rings or
+// SIGTERM comes. The death of another child (an earlier VPN child stopped
+// just before, say) is not a reason to stop waiting for this one.
+void WaitForChild(const WaitSignals& signals, pid_t child) {
+    alarm(g_waitSeconds);
+    for (;;) {
+        signals.Suspend();
+        const Reaped reaped = ReapDeadChildren(child);
+        const unsigned int left = alarm(0);
+        if (reaped != Reaped::OTHERS_ONLY || left == 0 || kill(child, 0) != 0) return;
+        alarm(left);
     }
 }
 
@@ -137,10 +159,7 @@ bool Tunnel::RunVPNTunnel(const char* proto) {
     }
 
     pid = child;
-    alarm(g_waitSeconds);
-    signals.Suspend();
-    ReapDeadChildren();
-    alarm(0);
+    WaitForChild(signals, child);
     unlink(path.c_str());
     return IsAlive();
 }

@@ -150,6 +150,27 @@ TEST_F(TunnelStart, ChildDyingBeforeTheWaitBeginsIsNotMissed) {
     EXPECT_EQ(-1, tunnel.pid);
 }
 
+TEST_F(TunnelStart, DeathOfAnotherChildDoesNotEndTheWait) {
+    int other = fork();
+    ASSERT_GE(other, 0);
+    if (other == 0) {
+        pause();
+        _exit(0);
+    }
+    children.push_back(other);
+    root.write("/standin/victim", std::to_string(other));
+    SetBehaviour("tcp-client", "kill-up");
+    Tunnel tunnel = MakeTunnel();
+    ASSERT_TRUE(tunnel.Create(false));
+    children.push_back(tunnel.pid);
+
+    // The wait went on past the other child's end until the up script's signal.
+    EXPECT_EQ(1, g_sigchld);
+    EXPECT_EQ(1, g_sigusr2);
+    EXPECT_EQ(0, g_sigalrm);
+    EXPECT_NE(other, tunnel.pid);
+}
+
 TEST_F(TunnelStart, SilentLiveChildCountsAsUpAfterTheWait) {
     SetTunnelWaitSeconds(1);
     SetBehaviour("udp", "hang");

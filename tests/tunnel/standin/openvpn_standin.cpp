@@ -6,6 +6,7 @@
 //   hang      neither signal nor die; wait for SIGTERM
 //   exit      exit at once with status 1
 //   late-exit exit with status 1 a moment later
+//   kill-up   kill the process in <root>/standin/victim, then a moment later "up"
 // On SIGTERM it writes term.N and exits with status 0.
 #include <signal.h>
 #include <sys/stat.h>
@@ -129,6 +130,11 @@ int main(int argc, char** argv) {
     if (behaviour == "late-exit") {
         usleep(200 * 1000);
         _exit(1);
+    }
+    if (behaviour == "kill-up") {
+        kill(std::stoi(ReadAll(dir + "/victim")), SIGKILL);
+        usleep(200 * 1000);
+        behaviour = "up";
     }
     if (behaviour == "up") RunRouteUp(OptionValue(argc, argv, "--route-up"));
     WaitForTerm(dir, call);
