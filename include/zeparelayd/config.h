@@ -202,6 +202,12 @@ public:
     std::string gateway;
     std::list<InterfaceConf> interfaces;
     std::string mode;  // set by the caller; never read from the system
+
+private:
+    void ReadInterfaces();
+    void ReadPppoe();
+    void ReadGateway();
+    void ReadDdns();
 };
 
 // The whole relay configuration.

@@ -33,19 +33,17 @@ struct Platform {
     int macCalls = 0;
     // VLIBNetGetInterfaceInfo: records, or a failure (result -1 / 0)
     std::vector<Interface> interfaces;
-    int interfaceResult = 0;  // used when interfaces is empty
+    int interfaceResult = 0;  // returned when interfaces is empty (0 or -1)
     int interfaceSelection = -1;
     int interfaceMax = -1;
     // ZEPAPPPoECheckStatus / ZEPAPPPoeNetInfoGet
     int pppoeStatus = 0;
+    int pppoeInfoCalls = 0;
     bool pppoeInfoFails = false;
     std::string pppoeIp;
     std::string pppoeMask;
     // ZEPANetDefaultGatewayGet
     std::string gateway;  // empty: fails
-    // ZEPADDNSConfigGet
-    std::string ddnsHost;      // empty: fails
-    std::string ddnsProvider;  // the provider last asked for
     // ZEPALnxV6IPGet: interfaces that exist, with their addresses
     std::vector<V6Interface> machine;
     int errorCode = 0x0900;
