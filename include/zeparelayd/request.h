@@ -52,12 +52,19 @@ public:
     RELAYD_RET GetError() const;
     bool SetTcpKeepAlive(int seconds);
     bool Write(Json::Value& out) const;
+    // The easy handle (null when invalid), for callers that tune or inspect
+    // a transfer themselves.
+    CURL* GetCurlHandle() const;
 
     // Process-wide cookie and DNS state.
     static CURLSH* GetCurlShare(bool renew);
     static bool CleanDnsCache();
     static std::string& GetCookie();
     static bool SetCookie(const std::string& cookie);
+    // A CA file trusted in addition to the system's for "https://" requests.
+    // Empty (the default) adds nothing; only staging set-ups and tests set it.
+    static void SetExtraCaFile(const std::string& path);
+    static const std::string& GetExtraCaFile();
     bool GetCookies(std::list<std::string>& out) const;
     bool SaveCookies();
 
@@ -77,6 +84,15 @@ private:
     bool _async;
     bool _done;
     long _httpStatus;
+    // True once CURLOPT_POSTFIELDS points at _data (until the handle is reset);
+    // a copy then re-points its duplicate at its own _data.
+    bool _postBody;
+
+    void Reset();
+    bool SetUpHandle();
+    bool SetUpHttps();
+    void FreeHandle();
+    bool AdoptHandleOf(const Request& other);
 };
 
 }  // namespace Relay

@@ -1,0 +1,167 @@
+// Request: process-wide share handle, DNS-cache reset, cookies and the TLS
+// context set-up.
+#define ZEPA_LOG_SOURCE "request"
+
+#include <arpa/inet.h>
+#include <netinet/in.h>
+#include <openssl/ssl.h>
+#include <resolv.h>
+#include <zeparelayd/request.h>
+
+#include <cstdio>
+#include <cstring>
+#include <vector>
+
+#include "common/log.h"
+#include "request/request_internal.h"
+
+namespace ZEPA {
+namespace Relay {
+
+std::string Request::_strCookie;
+CURLSH* Request::_share = nullptr;
+bool Request::blForbidConnReuse = false;
+
+namespace {
+
+std::string g_extraCaFile;
+
+// Shares given up while requests still used them, freed once their last
+// user is gone. Held by a pointer that is never freed, so that they stay
+// reachable when requests outlive the static destructors.
+std::vector<CURLSH*>& AbandonedShares() {
+    static std::vector<CURLSH*>* shares = new std::vector<CURLSH*>();
+    return *shares;
+}
+
+void DiscardShare() {
+    RequestInternal::ReleaseAbandonedShares();
+    if (Request::_share != nullptr) {
+        CURLSHcode rc = curl_share_cleanup(Request::_share);
+        if (rc != CURLSHE_OK) {
+            ZLOG(ZEPA_LOG_NOTICE, "curl_share_cleanup failed. [%d:%s]", rc, curl_share_strerror(rc));
+            AbandonedShares().push_back(Request::_share);
+        }
+    }
+    Request::_share = nullptr;
+    Request::blForbidConnReuse = true;
+}
+
+CURLSH* MakeShare() {
+    CURLSH* share = curl_share_init();
+    if (share == nullptr) {
+        ZLOG(ZEPA_LOG_ERR, "curl_share_init failed");
+        return nullptr;
+    }
+    if (curl_share_setopt(share, CURLSHOPT_SHARE, CURL_LOCK_DATA_COOKIE) != CURLSHE_OK) {
+        ZLOG(ZEPA_LOG_ERR, "set CURL_LOCK_DATA_COOKIE failed");
+        curl_share_cleanup(share);
+        return nullptr;
+    }
+    if (curl_share_setopt(share, CURLSHOPT_SHARE, CURL_LOCK_DATA_DNS) != CURLSHE_OK) {
+        ZLOG(ZEPA_LOG_ERR, "set CURL_LOCK_DATA_DNS failed");
+        curl_share_cleanup(share);
+        return nullptr;
+    }
+    return share;
+}
+
+// The host of a URL as the cookie lines name it: the text two characters after
+// the first "/", at most 127 characters, cut at a port or the path.
+std::string CookieHostOf(const std::string& url) {
+    size_t slash = url.find('/');
+    if (slash == std::string::npos || slash + 2 > url.size()) return "";
+    char host[128];
+    snprintf(host, sizeof(host), "%s", url.c_str() + slash + 2);
+    char* end = strchr(host, ':');
+    if (end == nullptr) end = strchr(host, '/');
+    if (end != nullptr) *end = '\0';
+    return host;
+}
+
+int AcceptEveryCertificate(int /*preverified*/, X509_STORE_CTX* /*ctx*/) { return 1; }
+
+}  // namespace
+
+namespace RequestInternal {
+
+void ReleaseAbandonedShares() {
+    std::vector<CURLSH*>& shares = AbandonedShares();
+    if (shares.empty()) return;
+    std::vector<CURLSH*> stillUsed;
+    for (CURLSH* share : shares) {
+        if (curl_share_cleanup(share) != CURLSHE_OK) stillUsed.push_back(share);
+    }
+    shares.swap(stillUsed);
+}
+
+size_t WriteResponse(char* ptr, size_t size, size_t count, void* userdata) {
+    size_t bytes = size * count;
+    if (bytes == 0) return 0;
+    static_cast<std::string*>(userdata)->append(ptr, bytes);
+    return bytes;
+}
+
+CURLcode SetUpSslContext(CURL* /*curl*/, void* sslctx, void* /*userdata*/) {
+    SSL_CTX* ctx = static_cast<SSL_CTX*>(sslctx);
+    SSL_CTX_set_verify(ctx, SSL_VERIFY_CLIENT_ONCE, AcceptEveryCertificate);
+    if (!g_extraCaFile.empty() && SSL_CTX_load_verify_locations(ctx, g_extraCaFile.c_str(), nullptr) != 1) {
+        ZLOG(ZEPA_LOG_WARNING, "load extra CA file [%s] failed", g_extraCaFile.c_str());
+    }
+    return CURLE_OK;
+}
+
+}  // namespace RequestInternal
+
+CURLSH* Request::GetCurlShare(bool renew) {
+    if (renew) {
+        DiscardShare();
+    } else if (_share != nullptr) {
+        return _share;
+    }
+    _share = MakeShare();
+    return _share;
+}
+
+bool Request::CleanDnsCache() {
+    res_init();
+    GetCurlShare(true);
+    return true;
+}
+
+std::string& Request::GetCookie() { return _strCookie; }
+
+bool Request::SetCookie(const std::string& cookie) {
+    _strCookie = cookie;
+    return true;
+}
+
+void Request::SetExtraCaFile(const std::string& path) { g_extraCaFile = path; }
+
+const std::string& Request::GetExtraCaFile() { return g_extraCaFile; }
+
+bool Request::GetCookies(std::list<std::string>& out) const {
+    if (_cookies.empty()) return false;
+    out = _cookies;
+    return true;
+}
+
+bool Request::SaveCookies() {
+    struct curl_slist* list = nullptr;
+    CURLcode rc = curl_easy_getinfo(_curl, CURLINFO_COOKIELIST, &list);
+    if (rc != CURLE_OK) {
+        ZLOG(ZEPA_LOG_ERR, "curl_easy_getinfo failed: %d", rc);
+        curl_slist_free_all(list);
+        return false;
+    }
+    // An empty host (a URL without "//host") matches no cookie.
+    std::string host = CookieHostOf(_url);
+    for (struct curl_slist* item = list; item != nullptr && !host.empty(); item = item->next) {
+        if (strncmp(item->data, host.c_str(), host.size()) == 0) _cookies.push_back(item->data);
+    }
+    curl_slist_free_all(list);
+    return true;
+}
+
+}  // namespace Relay
+}  // namespace ZEPA
