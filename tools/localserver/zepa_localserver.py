@@ -1,0 +1,473 @@
+#!/usr/bin/env python3
+"""Local HTTP and HTTPS server for tests and demos (loopback only).
+
+Serves plain HTTP and HTTPS on 127.0.0.1, each on a port chosen by the
+kernel, with a certificate signed by a throwaway CA made at start-up with the
+openssl command line tool. Once both are listening it writes
+
+    {"http_port": N, "https_port": M, "ca_file": "...", "pid": P}
+
+to the --ready-file (written to a temporary name, then renamed).
+
+Routes come from every routes_*.py module beside this file (or in
+--routes-dir). A module either defines register(server), which calls
+server.route(path, handler, methods=None), or a table ROUTES = {path: handler}.
+A handler takes a Req and returns a Reply (see below); route modules import
+them with "from zepa_localserver import Req, Reply, json_reply, text_reply".
+A handler may keep state in server.state (a dict, guarded by server.lock when
+needed), register reset hooks with server.on_reset(func), and sleep with
+server.wait(seconds), which returns True early when the server stops.
+
+Control API (never recorded):
+  GET  /_control/ping                  -> {"ok": true}
+  POST /_control/script                -> queue scripted answers for a path, body:
+         {"path": "/x", "count": 1, "status": 503, "body": "text",
+          "body_base64": "...", "json": {...}, "headers": {"K": "V"},
+          "action": "reply" | "hang" | "close" | "reset",
+          "seconds": 0.5}
+       "hang" waits `seconds` (default 30, cut short by shutdown), then closes
+       without an answer; "close" closes at once without an answer; "reset"
+       closes with a TCP reset; "reply" (the default) answers after `seconds`
+       (default 0).
+  GET  /_control/requests[?path=/x]    -> {"requests": [record, ...]} in arrival order
+  POST /_control/reset                 -> forgets records and scripts, runs reset hooks
+
+A record: {"seq", "scheme", "method", "target" (the raw request target),
+"path", "query", "has_query", "request_line_base64" (the request line's
+exact bytes), "version", "headers": [[name, value], ...] in wire order
+(latin-1),
+"body_base64", "body_latin1", "body_length"}.
+
+SIGTERM and SIGINT stop the server cleanly (exit status 0).
+"""
+
+import argparse
+import base64
+import glob
+import importlib.util
+import json
+import os
+import signal
+import socket
+import ssl
+import struct
+import subprocess
+import sys
+import tempfile
+import threading
+import time
+import urllib.parse
+from http.server import BaseHTTPRequestHandler, ThreadingHTTPServer
+
+CONTROL_PREFIX = "/_control/"
+
+
+class Req:
+    """One received request, as handlers see it."""
+
+    def __init__(self, handler, scheme, body):
+        self.method = handler.command
+        self.target = handler.path
+        split = urllib.parse.urlsplit(handler.path)
+        self.path = split.path
+        self.query = split.query
+        self.has_query = "?" in handler.path
+        self.version = handler.request_version
+        self.headers = [[k, v] for k, v in handler.headers.items()]
+        self.body = body
+        self.scheme = scheme
+        self.client_port = handler.client_address[1]
+        # The request line as received, for byte-exact checks of the target.
+        self.request_line = handler.raw_requestline.rstrip(b"\r\n")
+
+    def header(self, name, default=None):
+        lname = name.lower()
+        for k, v in self.headers:
+            if k.lower() == lname:
+                return v
+        return default
+
+    def params(self):
+        """Query parameters as a dict of last values."""
+        return dict(urllib.parse.parse_qsl(self.query, keep_blank_values=True))
+
+    def form(self):
+        """Form-encoded body as a dict of last values."""
+        text = self.body.decode("latin-1")
+        return dict(urllib.parse.parse_qsl(text, keep_blank_values=True))
+
+    def json(self):
+        return json.loads(self.body.decode("utf-8"))
+
+    def record(self):
+        return {
+            "scheme": self.scheme,
+            "method": self.method,
+            "target": self.target,
+            "path": self.path,
+            "query": self.query,
+            "has_query": self.has_query,
+            "request_line_base64": base64.b64encode(self.request_line).decode("ascii"),
+            "version": self.version,
+            "headers": self.headers,
+            "body_base64": base64.b64encode(self.body).decode("ascii"),
+            "body_latin1": self.body.decode("latin-1"),
+            "body_length": len(self.body),
+        }
+
+
+class Reply:
+    """An answer: status, body (bytes, str or a JSON-able object), headers.
+
+    action: "reply", "hang" (wait `seconds`, then close without answering),
+    "close" (close without answering) or "reset" (close with a TCP reset).
+    For "reply", `seconds` delays the answer.
+    """
+
+    def __init__(self, status=200, body=b"", headers=None, action="reply", seconds=0.0, content_type=None):
+        self.status = status
+        if isinstance(body, (dict, list)):
+            body = json.dumps(body).encode("utf-8")
+            content_type = content_type or "application/json"
+        elif isinstance(body, str):
+            body = body.encode("utf-8")
+        self.body = body
+        self.headers = list((headers or {}).items()) if isinstance(headers, dict) else list(headers or [])
+        self.action = action
+        self.seconds = seconds
+        if content_type and not any(k.lower() == "content-type" for k, _ in self.headers):
+            self.headers.append(("Content-Type", content_type))
+
+
+def json_reply(obj, status=200, headers=None):
+    return Reply(status, json.dumps(obj).encode("utf-8"), headers, content_type="application/json")
+
+
+def text_reply(text, status=200, headers=None):
+    return Reply(status, text, headers, content_type="text/plain")
+
+
+def _script_reply(spec):
+    body = b""
+    if "json" in spec:
+        body = json.dumps(spec["json"]).encode("utf-8")
+    elif "body_base64" in spec:
+        body = base64.b64decode(spec["body_base64"])
+    elif "body" in spec:
+        body = spec["body"].encode("utf-8")
+    action = spec.get("action", "reply")
+    seconds = float(spec.get("seconds", 30.0 if action == "hang" else 0.0))
+    return Reply(int(spec.get("status", 200)), body, spec.get("headers") or {}, action, seconds)
+
+
+class LocalServer:
+    """Route table, scripts and request records shared by both listeners."""
+
+    def __init__(self):
+        self.lock = threading.Lock()
+        self.routes = {}
+        self.scripts = {}
+        self.records = []
+        self.state = {}
+        self.reset_hooks = []
+        self.stopping = threading.Event()
+        self.http_port = 0
+        self.https_port = 0
+        self.ca_file = ""
+
+    # ---- extension interface ------------------------------------------------
+    def route(self, path, handler, methods=None):
+        """Serve path (exact match, no query) with handler(req) -> Reply."""
+        self.routes[path] = (handler, set(m.upper() for m in methods) if methods else None)
+
+    def on_reset(self, func):
+        """func() runs on POST /_control/reset."""
+        self.reset_hooks.append(func)
+
+    def wait(self, seconds):
+        """Sleeps up to seconds; returns early (True) when the server stops."""
+        return self.stopping.wait(seconds)
+
+    def requests(self, path=None):
+        with self.lock:
+            return [r for r in self.records if path is None or r["path"] == path]
+
+    # ---- dispatch -----------------------------------------------------------
+    def record(self, req):
+        with self.lock:
+            rec = req.record()
+            rec["seq"] = len(self.records) + 1
+            self.records.append(rec)
+
+    def take_script(self, path):
+        with self.lock:
+            queue = self.scripts.get(path)
+            if not queue:
+                return None
+            spec = queue[0]
+            spec["count"] -= 1
+            if spec["count"] <= 0:
+                queue.pop(0)
+            return _script_reply(spec)
+
+    def dispatch(self, req):
+        if req.path.startswith(CONTROL_PREFIX):
+            return self.control(req)
+        self.record(req)
+        scripted = self.take_script(req.path)
+        if scripted is not None:
+            return scripted
+        entry = self.routes.get(req.path)
+        if entry is None:
+            return text_reply("no route for %s\n" % req.path, 404)
+        handler, methods = entry
+        if methods is not None and req.method not in methods:
+            return text_reply("method not allowed\n", 405)
+        return handler(req)
+
+    def control(self, req):
+        name = req.path[len(CONTROL_PREFIX):]
+        if name == "ping":
+            return json_reply({"ok": True})
+        if name == "script" and req.method == "POST":
+            spec = req.json()
+            if "path" not in spec:
+                return json_reply({"ok": False, "error": "path missing"}, 400)
+            spec["count"] = int(spec.get("count", 1))
+            with self.lock:
+                self.scripts.setdefault(spec["path"], []).append(spec)
+            return json_reply({"ok": True})
+        if name == "requests":
+            path = req.params().get("path")
+            return json_reply({"requests": self.requests(path)})
+        if name == "reset" and req.method == "POST":
+            with self.lock:
+                self.records = []
+                self.scripts = {}
+            for hook in self.reset_hooks:
+                hook()
+            return json_reply({"ok": True})
+        return json_reply({"ok": False, "error": "unknown control " + name}, 404)
+
+
+class Handler(BaseHTTPRequestHandler):
+    protocol_version = "HTTP/1.1"
+    server_version = "ZepaLocal/1.0"
+    scheme = "http"
+
+    def log_message(self, fmt, *args):
+        if self.server.app.verbose:
+            sys.stderr.write("localserver: %s\n" % (fmt % args))
+
+    def _read_body(self):
+        length = self.headers.get("Content-Length")
+        if length is not None:
+            return self.rfile.read(int(length))
+        if self.headers.get("Transfer-Encoding", "").lower() == "chunked":
+            body = b""
+            while True:
+                size = int(self.rfile.readline().split(b";")[0].strip(), 16)
+                if size == 0:
+                    self.rfile.readline()
+                    return body
+                body += self.rfile.read(size)
+                self.rfile.readline()
+        return b""
+
+    def _handle(self):
+        app = self.server.app
+        req = Req(self, self.scheme, self._read_body())
+        try:
+            reply = app.dispatch(req)
+        except Exception as exc:  # a broken route answers 500, the server lives on
+            reply = text_reply("route failed: %r\n" % (exc,), 500)
+        self._send(reply)
+
+    def _send(self, reply):
+        app = self.server.app
+        if reply.action == "hang":
+            app.wait(reply.seconds)
+            self.close_connection = True
+            return
+        if reply.action == "close":
+            self.close_connection = True
+            return
+        if reply.action == "reset":
+            # Linger 0 and an immediate close: a RST without a FIN before it.
+            self.connection.setsockopt(socket.SOL_SOCKET, socket.SO_LINGER, struct.pack("ii", 1, 0))
+            os.close(self.connection.detach())
+            self.close_connection = True
+            return
+        if reply.seconds > 0 and app.wait(reply.seconds):
+            self.close_connection = True
+            return
+        self.send_response(reply.status)
+        names = set()
+        for k, v in reply.headers:
+            self.send_header(k, v)
+            names.add(k.lower())
+        if "content-length" not in names:
+            self.send_header("Content-Length", str(len(reply.body)))
+        self.end_headers()
+        if self.command != "HEAD":
+            try:
+                self.wfile.write(reply.body)
+            except (BrokenPipeError, ConnectionResetError, ssl.SSLError):
+                self.close_connection = True
+
+    do_GET = _handle
+    do_POST = _handle
+    do_PUT = _handle
+    do_DELETE = _handle
+    do_HEAD = _handle
+    do_PATCH = _handle
+
+
+class HttpsHandler(Handler):
+    scheme = "https"
+
+
+class Listener(ThreadingHTTPServer):
+    daemon_threads = True
+    allow_reuse_address = True
+
+    def __init__(self, app, handler, ssl_context=None):
+        super().__init__(("127.0.0.1", 0), handler)
+        self.app = app
+        self.ssl_context = ssl_context
+
+    def get_request(self):
+        sock, addr = super().get_request()
+        if self.ssl_context is not None:
+            # The handshake runs in the request thread, so a client that never
+            # speaks TLS cannot block the listener.
+            sock = self.ssl_context.wrap_socket(sock, server_side=True, do_handshake_on_connect=False)
+        return sock, addr
+
+    def finish_request(self, request, client_address):
+        if isinstance(request, ssl.SSLSocket):
+            try:
+                request.settimeout(10)
+                request.do_handshake()
+                request.settimeout(None)
+            except (ssl.SSLError, OSError):
+                return
+        super().finish_request(request, client_address)
+
+    def handle_error(self, request, client_address):
+        if self.app.verbose:
+            super().handle_error(request, client_address)
+
+
+def _openssl(*args):
+    subprocess.run(["openssl"] + list(args), check=True, stdout=subprocess.DEVNULL, stderr=subprocess.PIPE)
+
+
+def make_certificates(cert_dir):
+    """Throwaway CA and a server certificate for 127.0.0.1 and localhost."""
+    os.makedirs(cert_dir, exist_ok=True)
+    ca_key = os.path.join(cert_dir, "ca.key")
+    ca_crt = os.path.join(cert_dir, "ca.crt")
+    key = os.path.join(cert_dir, "server.key")
+    csr = os.path.join(cert_dir, "server.csr")
+    crt = os.path.join(cert_dir, "server.crt")
+    ext = os.path.join(cert_dir, "server.ext")
+    ec = ["-newkey", "ec", "-pkeyopt", "ec_paramgen_curve:prime256v1", "-nodes"]
+    _openssl("req", "-x509", *ec, "-keyout", ca_key, "-out", ca_crt, "-days", "2",
+             "-subj", "/CN=Zepa Local Test CA",
+             "-addext", "basicConstraints=critical,CA:TRUE",
+             "-addext", "keyUsage=critical,keyCertSign,cRLSign")
+    _openssl("req", "-new", *ec, "-keyout", key, "-out", csr, "-subj", "/CN=localhost")
+    with open(ext, "w") as f:
+        f.write("subjectAltName=IP:127.0.0.1,DNS:localhost\n"
+                "basicConstraints=CA:FALSE\n"
+                "keyUsage=critical,digitalSignature,keyEncipherment\n"
+                "extendedKeyUsage=serverAuth\n")
+    _openssl("x509", "-req", "-in", csr, "-CA", ca_crt, "-CAkey", ca_key, "-set_serial",
+             str(int.from_bytes(os.urandom(8), "big")), "-days", "2", "-out", crt, "-extfile", ext)
+    return ca_crt, crt, key
+
+
+def load_routes(app, routes_dir):
+    # Route modules import Reply and the helpers from "zepa_localserver": let
+    # that name mean this very module when it runs as the program.
+    sys.modules.setdefault("zepa_localserver", sys.modules[__name__])
+    for path in sorted(glob.glob(os.path.join(routes_dir, "routes_*.py"))):
+        name = "zepa_" + os.path.splitext(os.path.basename(path))[0]
+        spec = importlib.util.spec_from_file_location(name, path)
+        module = importlib.util.module_from_spec(spec)
+        sys.modules[name] = module
+        spec.loader.exec_module(module)
+        if hasattr(module, "register"):
+            module.register(app)
+        for route_path, handler in getattr(module, "ROUTES", {}).items():
+            app.route(route_path, handler)
+
+
+def write_ready(path, info):
+    tmp = "%s.tmp.%d" % (path, os.getpid())
+    with open(tmp, "w") as f:
+        json.dump(info, f)
+    os.rename(tmp, path)
+
+
+def main(argv=None):
+    parser = argparse.ArgumentParser(description=__doc__.split("\n")[0])
+    parser.add_argument("--ready-file", required=True, help="where the chosen ports are written as JSON")
+    parser.add_argument("--cert-dir", help="where the throwaway CA and server certificate go "
+                        "(default: a temporary folder removed at exit)")
+    parser.add_argument("--routes-dir", default=os.path.dirname(os.path.abspath(__file__)),
+                        help="folder of routes_*.py modules (default: beside this program)")
+    parser.add_argument("--no-https", action="store_true", help="serve plain HTTP only")
+    parser.add_argument("--verbose", action="store_true", help="log every request to standard error")
+    args = parser.parse_args(argv)
+
+    app = LocalServer()
+    app.verbose = args.verbose
+    load_routes(app, args.routes_dir)
+
+    temp_dir = None
+    cert_dir = args.cert_dir
+    if cert_dir is None and not args.no_https:
+        temp_dir = tempfile.TemporaryDirectory(prefix="zepa_localserver_")
+        cert_dir = temp_dir.name
+
+    listeners = [Listener(app, Handler)]
+    if not args.no_https:
+        ca_crt, crt, key = make_certificates(cert_dir)
+        context = ssl.SSLContext(ssl.PROTOCOL_TLS_SERVER)
+        context.load_cert_chain(crt, key)
+        listeners.append(Listener(app, HttpsHandler, context))
+        app.ca_file = ca_crt
+        app.https_port = listeners[1].server_address[1]
+    app.http_port = listeners[0].server_address[1]
+
+    threads = [threading.Thread(target=l.serve_forever, kwargs={"poll_interval": 0.1}, daemon=True)
+               for l in listeners]
+    for t in threads:
+        t.start()
+
+    stop = threading.Event()
+
+    def on_signal(signum, frame):
+        stop.set()
+
+    signal.signal(signal.SIGTERM, on_signal)
+    signal.signal(signal.SIGINT, on_signal)
+
+    write_ready(args.ready_file, {"http_port": app.http_port, "https_port": app.https_port,
+                                  "ca_file": app.ca_file, "pid": os.getpid()})
+    while not stop.wait(0.2):
+        pass
+
+    app.stopping.set()
+    for l in listeners:
+        l.shutdown()
+        l.server_close()
+    if temp_dir is not None:
+        temp_dir.cleanup()
+    return 0
+
+
+if __name__ == "__main__":
+    sys.exit(main())
