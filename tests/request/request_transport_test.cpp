@@ -455,3 +455,16 @@ TEST_F(RequestTransport, KeepAliveRequestIsStillSent) {
     EXPECT_EQ("", capture.stop());
     EXPECT_TRUE(request.Send());
 }
+
+TEST_F(RequestTransport, EveryTransferUsesAFreshConnection) {
+    Request request(server.httpUrl("/test/json").c_str(), "", false);
+    ASSERT_TRUE(request.Send());
+    ASSERT_TRUE(request.Send());
+    Request other(server.httpUrl("/test/json").c_str(), "", false);
+    ASSERT_TRUE(other.Send());
+    Json::Value records = server.requests("/test/json");
+    ASSERT_EQ(3u, records.size());
+    // The server keeps HTTP/1.1 connections open; the client closes each one.
+    EXPECT_NE(records[0]["client_port"].asInt(), records[1]["client_port"].asInt());
+    EXPECT_NE(records[1]["client_port"].asInt(), records[2]["client_port"].asInt());
+}

@@ -68,7 +68,7 @@ LocalServer::LocalServer() { Start(Options()); }
 
 LocalServer::LocalServer(const Options& options) { Start(options); }
 
-LocalServer::~LocalServer() { Stop(); }
+LocalServer::~LocalServer() { stop(); }
 
 void LocalServer::Start(const Options& options) {
     char tmpl[] = "/tmp/zepa_localserver.XXXXXX";
@@ -128,10 +128,11 @@ void LocalServer::Start(const Options& options) {
     _ok = _httpPort > 0;
 }
 
-void LocalServer::Stop() {
+int LocalServer::stop() {
+    int status = -1;
     if (_pid > 0) {
         kill(_pid, SIGTERM);
-        int status = 0;
+        status = 0;
         bool reaped = false;
         for (int waited = 0; waited < kStopTimeoutMs && !reaped; waited += 10) {
             reaped = waitpid(_pid, &status, WNOHANG) == _pid;
@@ -148,6 +149,8 @@ void LocalServer::Stop() {
         if (system(cmd.c_str()) != 0) fprintf(stderr, "warning: could not remove %s\n", _dir.c_str());
         _dir.clear();
     }
+    _ok = false;
+    return status;
 }
 
 std::string LocalServer::httpUrl(const std::string& path) const {

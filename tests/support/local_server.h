@@ -58,13 +58,16 @@ public:
     // Forgets records and scripts.
     bool reset();
 
+    // Stops the server now (SIGTERM, after 5 s SIGKILL) and reaps it. The
+    // wait status, or -1 when no server ran. The destructor does the same.
+    int stop();
+
     // Plain libcurl call on the control API; false on transport failure.
     bool control(const std::string& method, const std::string& path, const std::string& body,
                  std::string& answer, long& status) const;
 
 private:
     void Start(const Options& options);
-    void Stop();
 
     bool _ok = false;
     std::string _error;

@@ -36,7 +36,7 @@ A record: {"seq", "scheme", "method", "target" (the raw request target),
 "path", "query", "has_query", "request_line_base64" (the request line's
 exact bytes), "version", "headers": [[name, value], ...] in wire order
 (latin-1),
-"body_base64", "body_latin1", "body_length"}.
+"body_base64", "body_latin1", "body_length", "client_port"}.
 
 SIGTERM and SIGINT stop the server cleanly (exit status 0).
 """
@@ -113,6 +113,7 @@ class Req:
             "body_base64": base64.b64encode(self.body).decode("ascii"),
             "body_latin1": self.body.decode("latin-1"),
             "body_length": len(self.body),
+            "client_port": self.client_port,
         }
 
 
