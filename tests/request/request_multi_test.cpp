@@ -146,7 +146,7 @@ std::unique_ptr<Request> Make(const std::string& url, const char* data, bool pos
 using RequestMulti = ServerTest;
 
 TEST_F(RequestMulti, SeveralRequestsRunAtOnceAndAreFoundByTheirHandles) {
-    ASSERT_TRUE(server.hang("/test/text", 1.0));
+    ASSERT_TRUE(server.hang("/test/text", 2.0));
     const std::string refused = "http://127.0.0.1:" + std::to_string(requesttest::ClosedLoopbackPort()) + "/";
     auto json = Make(server.httpUrl("/test/json"), "", false);
     auto post = Make(server.httpUrl("/test/echo"), "x=1&y=2", true);

@@ -215,3 +215,30 @@ TEST_F(RequestPayload, ErrorBufferOfACopyIsItsOwn) {
     EXPECT_FALSE(copy.Send());
     EXPECT_EQ(CURLE_COULDNT_CONNECT, copy.GetCurlResult());
 }
+
+TEST_F(RequestPayload, CurlCodesAreClassified) {
+    struct Case {
+        CURLcode code;
+        int expected;
+    } cases[] = {{CURLE_COULDNT_RESOLVE_HOST, 7},
+                 {CURLE_COULDNT_CONNECT, 6},
+                 {CURLE_OPERATION_TIMEDOUT, 6},
+                 {CURLE_SSL_CONNECT_ERROR, 6},
+                 {CURLE_SEND_ERROR, 6},
+                 {CURLE_RECV_ERROR, 6},
+                 {CURLE_AGAIN, 6},
+                 {CURLE_URL_MALFORMAT, 2},
+                 {CURLE_GOT_NOTHING, 2},
+                 {CURLE_PEER_FAILED_VERIFICATION, 2},
+                 {CURLE_COULDNT_RESOLVE_PROXY, 2}};
+    for (const Case& c : cases) {
+        Request request(server.httpUrl("/test/json").c_str(), "", false);
+        StderrCapture capture;
+        request.JobDone(c.code);
+        EXPECT_EQ(c.expected, static_cast<int>(request.GetError())) << c.code;
+        std::string log = capture.stop();
+        EXPECT_TRUE(zepatest::LogContains(
+            log, " curl error: " + std::to_string(c.code) + ", " + curl_easy_strerror(c.code)))
+            << log;
+    }
+}
