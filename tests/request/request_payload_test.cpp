@@ -242,3 +242,17 @@ TEST_F(RequestPayload, CurlCodesAreClassified) {
             << log;
     }
 }
+
+TEST_F(RequestPayload, JsonQueryWithTheWritersNewlineIsRefusedByLibcurl) {
+    // The data is placed unescaped, so the serialised text's newline ends up
+    // in the URL, which libcurl refuses before connecting.
+    Json::Value body;
+    body["a"] = 1;
+    Request request(server.httpUrl("/test/echo"), body, false);
+    EXPECT_EQ("{\"a\":1}\n", request.GetData());
+    EXPECT_TRUE(request.IsValid());
+    EXPECT_FALSE(request.Send());
+    EXPECT_EQ(CURLE_URL_MALFORMAT, request.GetCurlResult());
+    EXPECT_EQ(2, static_cast<int>(request.GetError()));
+    EXPECT_EQ(0u, server.requests().size());
+}
