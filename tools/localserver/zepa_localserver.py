@@ -59,6 +59,9 @@ import time
 import urllib.parse
 from http.server import BaseHTTPRequestHandler, ThreadingHTTPServer
 
+# Route modules are loaded from the source tree: leave no bytecode there.
+sys.dont_write_bytecode = True
+
 CONTROL_PREFIX = "/_control/"
 
 
