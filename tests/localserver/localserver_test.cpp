@@ -92,7 +92,7 @@ TEST_F(LocalServerTest, StopsCleanlyWhileARequestHangs) {
     curl_easy_setopt(curl, CURLOPT_URL, url.c_str());
     curl_multi_add_handle(multi, curl);
     int running = 0;
-    for (int i = 0; i < 200 && server.requests("/test/json").size() == 0; ++i) {
+    for (int i = 0; i < 1000 && server.requests("/test/json").size() == 0; ++i) {
         curl_multi_perform(multi, &running);
         curl_multi_wait(multi, nullptr, 0, 10, nullptr);
     }
