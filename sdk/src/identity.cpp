@@ -64,16 +64,20 @@ bool ReadSecret(const std::string& path, std::string& secret) {
     return !secret.empty();
 }
 
-// Creates the secret once; a concurrent creator wins and its secret is read.
+// Creates the secret once, complete or not at all: written to a temporary
+// file, then linked to its name, so a concurrent creator wins and a crash
+// leaves no empty secret behind.
 bool CreateSecret(const std::string& path) {
     std::string secret;
     if (!RandomHex(SECRET_BYTES, secret) || !zepasdk::MakeParentDirs(path)) return false;
-    int fd = open(path.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, 0600);
-    if (fd < 0) return errno == EEXIST;
+    std::string tmp = path + ".tmp." + std::to_string(getpid());
+    int fd = open(tmp.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0600);
+    if (fd < 0) return false;
     secret += "\n";
     bool ok = write(fd, secret.data(), secret.size()) == static_cast<ssize_t>(secret.size());
-    if (close(fd) != 0) ok = false;
-    if (!ok) unlink(path.c_str());
+    if (fsync(fd) != 0 || close(fd) != 0) ok = false;
+    if (ok && link(tmp.c_str(), path.c_str()) != 0 && errno != EEXIST) ok = false;
+    unlink(tmp.c_str());
     return ok;
 }
 

@@ -157,6 +157,25 @@ TEST_F(HubtokenTest, GenerateFailsWithoutUsableSecret) {
     EXPECT_STREQ("", token);
 }
 
+TEST_F(HubtokenTest, EmptySecretIsNotReplaced) {
+    root.write("/etc/zepa/hubtoken.secret", "", 0600);
+    char token[33];
+    EXPECT_EQ(-1, ZEPAHubtokenGenerateToken("S", token, sizeof(token)));
+    EXPECT_EQ(ZEPA_ERR_IO, VLIBCErrGet());
+    EXPECT_EQ("", root.read("/etc/zepa/hubtoken.secret"));
+}
+
+TEST_F(HubtokenTest, CreationLeavesNoTemporaryFile) {
+    Generate("S");
+    std::string listing;
+    DIR* dir = opendir(root.path("/etc/zepa").c_str());
+    ASSERT_NE(nullptr, dir);
+    while (struct dirent* e = readdir(dir))
+        if (e->d_name[0] != '.') listing += std::string(e->d_name) + " ";
+    closedir(dir);
+    EXPECT_EQ("hubtoken.secret ", listing);
+}
+
 TEST_F(ApiKeyTest, RegisterStoresFreshKey) {
     char key[ZEPA_CLOUD_KEY_SIZE];
     EXPECT_EQ(64, ZEPACloudServiceRegisterApiKey(key, sizeof(key)));

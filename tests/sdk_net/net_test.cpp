@@ -63,9 +63,12 @@ TEST_F(NetLiveTest, LoopbackIsListedWhenSelected) {
     std::shared_ptr<VLIBNetIfInfo> lo = Find(all, "lo");
     ASSERT_NE(nullptr, lo);
     EXPECT_EQ(VLIBNET_SEL_LOOPBACK, lo->kind);
-    EXPECT_STREQ("127.0.0.1", lo->szIP);
-    EXPECT_STREQ("255.0.0.0", lo->szMask);
-    EXPECT_EQ(VLIBNET_IF_UP_IPV4, lo->status);
+    if (lo->status == VLIBNET_IF_UP_IPV4) {
+        EXPECT_STREQ("127.0.0.1", lo->szIP);
+        EXPECT_STREQ("255.0.0.0", lo->szMask);
+    } else {
+        EXPECT_STREQ("", lo->szIP);
+    }
     EXPECT_EQ(nullptr, Find(Interfaces(VLIBNET_SEL_WIRED), "lo"));
 }
 
@@ -98,6 +101,7 @@ TEST_F(NetLiveTest, MaxLimitsTheRecords) {
 }
 
 TEST_F(NetLiveTest, DefaultGatewayAgreesWithIpTool) {
+    if (!Shell("ip -V")) GTEST_SKIP() << "the ip tool is missing";
     std::string route = Output("ip -4 route show default");
     char gw[20] = "x";
     int rc = ZEPANetDefaultGatewayGet(gw, sizeof(gw));
@@ -139,6 +143,7 @@ TEST_F(NetLiveTest, LoopbackIpv6AndMissingInterface) {
 }
 
 TEST_F(NetLiveTest, NoPppoeLinkHere) {
+    if (!Shell("ip -V")) GTEST_SKIP() << "the ip tool is missing";
     if (Output("ip -o link show type ppp").find("ppp") != std::string::npos)
         GTEST_SKIP() << "a PPP link exists";
     EXPECT_EQ(0, ZEPAPPPoECheckStatus(0));

@@ -48,8 +48,8 @@ ZEPASDK_API int ZEPAHubtokenGetToken(char* serial, int serialSize, char* token, 
  * on first use. Nothing is stored besides the secret.
  * 0 on success; -1: serial NULL or empty or token NULL
  * (ZEPA_ERR_BAD_PARAMETERS), tokenSize below ZEPA_HUBTOKEN_TOKEN_SIZE
- * (ZEPA_ERR_BUFFER_TOO_SMALL), the secret can be neither read nor created
- * (ZEPA_ERR_IO). */
+ * (ZEPA_ERR_BUFFER_TOO_SMALL), the secret can be neither read nor created,
+ * or it is empty (ZEPA_ERR_IO; an existing secret is never replaced). */
 ZEPASDK_API int ZEPAHubtokenGenerateToken(const char* serial, char* token, int tokenSize);
 
 /* The MAC address of the device's first wired interface, lower-case and
