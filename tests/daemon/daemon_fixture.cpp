@@ -44,6 +44,7 @@ void WriteDump(pid_t self, int dumps) {
         int sig = sigwaitinfo(&set, nullptr);
         if (sig < 0) continue;
         if (sig == SIGUSR1 && mode == DumpMode::ANSWER) WriteDump(getpid(), ++dumps);
+        if (sig == SIGUSR1 && mode == DumpMode::REMOVE) unlink(DebugFile(getpid()).c_str());
         if (write(reports, &sig, sizeof(sig)) != sizeof(sig)) _exit(3);
         if (sig == SIGTERM) _exit(0);
     }

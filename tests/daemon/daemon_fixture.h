@@ -40,7 +40,8 @@ int ReapAll();
 pid_t PidInFile(const std::string& path);
 
 // What a stand-in daemon does with SIGUSR1.
-enum class DumpMode { ANSWER, IGNORE };
+// REMOVE deletes the debug file instead of writing it.
+enum class DumpMode { ANSWER, IGNORE, REMOVE };
 
 // A forked child that waits for signals with sigwaitinfo and reports every
 // signal it gets through a pipe. On SIGUSR1 in ANSWER mode it writes

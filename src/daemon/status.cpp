@@ -1,0 +1,171 @@
+// Status readers: run in other processes than the daemon and report to the
+// system log, never to the library log.
+#define ZEPA_LOG_SOURCE "daemon"
+
+#include <json/reader.h>
+#include <libdaemon/dpid.h>
+#include <sys/file.h>
+#include <syslog.h>
+#include <unistd.h>
+
+#include <csignal>
+#include <cstdio>
+#include <fstream>
+
+#include <zeparelayd/errors.h>
+#include <zeparelayd/filelock.h>
+
+#include "common/log.h"
+#include "common/paths.h"
+#include "daemon/status_file.h"
+#include "daemon/status_seam.h"
+
+namespace ZEPA {
+namespace Relay {
+
+namespace {
+
+const int RUNNING = 0;
+const int NOT_RUNNING = 1;
+const int BUSY = 11;
+const int BROKEN = 255;
+
+const int STATE_NOT_RUNNING = 1;
+const int ERROR_NONE = 0;
+const char NOT_RELAYED[] = "--";
+
+// The daemon gets 50 us, then up to 30 reads 100 us apart, to write its dump.
+const unsigned int FIRST_PAUSE_US = 50;
+const unsigned int RETRY_PAUSE_US = 100;
+const int PARSE_ATTEMPTS = 30;
+
+void Usleep(unsigned int usec) { usleep(usec); }
+
+bool ParseStream(std::istream& in, Json::Value& out) {
+    Json::Reader reader;
+    return reader.parse(in, out, true);
+}
+
+std::string DebugFilePath(pid_t pid) {
+    char name[1024];
+    snprintf(name, sizeof(name), Paths::DEBUG_FILE_FORMAT, static_cast<int>(pid));
+    return Paths::Resolve(name);
+}
+
+int IntMember(const Json::Value& value, const char* key, int fallback) {
+    if (!value.isObject() || !value.isMember(key) || !value[key].isInt()) return fallback;
+    return value[key].asInt();
+}
+
+// Numbers outside the enumeration's range all word as "err_unknown".
+RELAYD_RET ErrorCode(int errorNo) {
+    if (errorNo < 0 || errorNo > RELAYD_ERR_UNKNOWN) return RELAYD_ERR_UNKNOWN;
+    return static_cast<RELAYD_RET>(errorNo);
+}
+
+bool RelaysService(const Json::Value& status, const char* serviceId) {
+    const Json::Value& services = status["service"];
+    if (!services.isArray()) return false;
+    for (const Json::Value& service : services) {
+        if (!service.isObject()) continue;
+        const Json::Value& id = service["id"];
+        if (id.isConvertibleTo(Json::stringValue) && id.asString() == serviceId) return true;
+    }
+    return false;
+}
+
+// Reads the dump the daemon writes after SIGUSR1; the caller holds the lock.
+int ReadDebugDump(const std::string& path, Json::Value& out) {
+    g_statusSleep(FIRST_PAUSE_US);
+    for (int attempt = 1;; ++attempt) {
+        std::ifstream in(path);
+        if (!in.is_open()) {
+            ZSYSLOG(LOG_ERR, "zeparelayd status file is not ready");
+            unlink(path.c_str());
+            return BROKEN;
+        }
+        if (ParseStream(in, out)) {
+            in.close();
+            unlink(path.c_str());
+            return RUNNING;
+        }
+        if (attempt == PARSE_ATTEMPTS) {
+            ZSYSLOG(LOG_DEBUG, "zeparelayd status parse failed");
+            in.close();
+            unlink(path.c_str());
+            return BUSY;
+        }
+        g_statusSleep(RETRY_PAUSE_US);
+    }
+}
+
+}  // namespace
+
+void (*g_statusSleep)(unsigned int usec) = Usleep;
+
+int LoadStatusFile(Json::Value& out, pid_t& pid) {
+    out = Json::Value();
+    std::ifstream in(Paths::Resolve(Paths::STATUS_FILE));
+    if (!in.is_open()) return NOT_RUNNING;
+    if (!ParseStream(in, out)) {
+        ZSYSLOG(LOG_ERR, "bad zeparelayd status file");
+        return BROKEN;
+    }
+    if (!out.isObject() || !out.isMember("pid") || !out["pid"].isInt() || out["pid"].asInt() == -1) {
+        ZSYSLOG(LOG_ERR, "bad zeparelayd status pid");
+        return BROKEN;
+    }
+    pid = out["pid"].asInt();
+    return RUNNING;
+}
+
+int Daemon::GetStatus(Json::Value& out) {
+    pid_t pid = 0;
+    int ret = LoadStatusFile(out, pid);
+    if (ret != RUNNING) return ret;
+    return kill(pid, 0) == 0 ? RUNNING : NOT_RUNNING;
+}
+
+bool Daemon::GetStatus(std::string& serverId, std::string& state, std::string& error, const char* serviceId) {
+    serverId.clear();
+    state.clear();
+    error.clear();
+    Json::Value status;
+    int probe = GetStatus(status);
+    if (status.isObject() && status["serverID"].isString()) serverId = status["serverID"].asString();
+    int stateNo = IntMember(status, "state", STATE_NOT_RUNNING);
+    int errorNo = IntMember(status, "error", ERROR_NONE);
+    if (probe == BROKEN) return false;
+    // A stale file or a service not relayed both read as "not running".
+    bool relayed = probe == RUNNING && (serviceId == nullptr || RelaysService(status, serviceId));
+    if (!relayed) {
+        stateNo = STATE_NOT_RUNNING;
+        errorNo = ERROR_NONE;
+        if (serviceId != nullptr) serverId = NOT_RELAYED;
+    }
+    state = GetStateStr(static_cast<RELAYD_STATE>(stateNo));
+    error = GetErrorStr(ErrorCode(errorNo));
+    return true;
+}
+
+int Daemon::DebugStatus(Json::Value& out) {
+    LibInit();
+    out = Json::Value();
+    pid_t pid = daemon_pid_file_is_running();
+    if (pid < 0) return NOT_RUNNING;
+    const std::string path = DebugFilePath(pid);
+    FileLock lock(path.c_str());
+    if (!lock.Lock(LOCK_EX)) {
+        ZSYSLOG(LOG_INFO, "lock failed");
+        return BUSY;
+    }
+    if (daemon_pid_file_kill(SIGUSR1) < 0) {
+        // The empty debug file is left behind on purpose.
+        ZSYSLOG(LOG_ERR, "daemon is not running");
+        return NOT_RUNNING;
+    }
+    return ReadDebugDump(path, out);
+}
+
+}  // namespace Relay
+}  // namespace ZEPA
