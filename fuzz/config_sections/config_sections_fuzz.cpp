@@ -1,0 +1,106 @@
+// Any bytes as JSON handed to every section: Overwrite, IsValid and Write must
+// not crash, and the written form must read back to the same section.
+#include <json/reader.h>
+#include <json/writer.h>
+#include <unistd.h>
+#include <zepasdk/sysroot.h>
+
+#include <cstdint>
+#include <cstdio>
+#include <cstdlib>
+#include <string>
+
+#include <zeparelayd/config.h>
+#include <zeparelayd/config_alias.h>
+#include <zeparelayd/daemon.h>
+
+using namespace ZEPA::Relay;
+
+namespace {
+
+// A private root: token generation creates the device secret below it.
+void UsePrivateRoot() {
+    static bool done = false;
+    if (done) return;
+    done = true;
+    static char tmpl[] = "/tmp/zepafuzz.XXXXXX";
+    if (mkdtemp(tmpl) == nullptr) abort();
+    ZEPASysRootSet(tmpl);
+    atexit([] {
+        std::string root = tmpl;
+        unlink((root + "/etc/zepa/hubtoken.secret").c_str());
+        rmdir((root + "/etc/zepa").c_str());
+        rmdir((root + "/etc").c_str());
+        rmdir(tmpl);
+    });
+    Daemon::_logLevel = 2;  // failures of the generation are not what is tested here
+}
+
+void Check(bool ok, const char* what) {
+    if (!ok) {
+        fprintf(stderr, "property failed: %s\n", what);
+        abort();
+    }
+}
+
+std::string Text(const Config& conf, bool full) {
+    Json::Value out;
+    Check(conf.Write(out, full), "Write returns true");
+    return Json::FastWriter().write(out);
+}
+
+// Fills a fresh section from the value, then from its own written form.
+template <typename Section, typename... Args>
+void RoundTrip(const Json::Value& value, bool full, const char* name, Args... args) {
+    Section conf(args...);
+    Check(conf.Overwrite(value), name);
+    conf.IsValid();
+    Json::Value written;
+    conf.Write(written, full);
+    Section back(args...);
+    back.Overwrite(written);
+    Check(Text(conf, full) == Text(back, full), name);
+}
+
+}  // namespace
+
+extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
+    UsePrivateRoot();
+    Json::Value value;
+    Json::Reader reader;
+    reader.parse(std::string(reinterpret_cast<const char*>(data), size), value, false);
+
+    RoundTrip<ServerConf>(value, true, "server section reads back", nullptr, nullptr);
+    RoundTrip<MyHubConf>(value, true, "account section reads back");
+    RoundTrip<SupportChannelConf>(value, true, "support channel reads back");
+    RoundTrip<AliasConf>(value, false, "alias section reads back");
+    RoundTrip<AliasConf>(value, true, "compact alias section reads back");
+    RoundTrip<InterfaceConf>(value, true, "interface reads back");
+
+    NetworkConf network(false);
+    network.Overwrite(value);
+    Check(network.IsValid(), "only valid interfaces are kept");
+    Json::Value written;
+    network.Write(written, true);
+    NetworkConf back(false);
+    back.Overwrite(written);
+    Check(network == back && network.mode == back.mode, "network state reads back");
+
+    AuthConf auth(false);
+    Check(auth.Overwrite(value), "identity overwrite");
+    Json::Value identity;
+    auth.Write(identity, true);
+    if (!auth.token.empty()) {
+        AuthConf again(false);
+        again.Overwrite(identity);
+        Check(Text(auth, true) == Text(again, true), "identity reads back");
+    }
+
+    if (value.isObject() && value.isMember("server_alias")) {
+        AliasConf alias;
+        alias.Overwrite(value["server_alias"]);
+        int t = alias.GetPollingTime();
+        Check(t >= alias.GetPollSeconds() && t < 2 * alias.GetPollSeconds(), "polling time in range");
+    }
+    return 0;
+}
