@@ -1,0 +1,161 @@
+// Sending an alias command and classifying what came back.
+#define ZEPA_LOG_SOURCE "request_alias"
+
+#include <curl/curl.h>
+#include <json/reader.h>
+
+#include <zeparelayd/request_alias.h>
+#include <sstream>
+
+#include "common/log.h"
+
+namespace ZEPA {
+namespace Relay {
+
+namespace {
+
+// The libcurl code this file logged last; 0 after a good transfer.
+int g_lastLoggedCurlCode = 0;
+
+// Logs a failing code once per run of equal codes.
+void LogCurlError(int code) {
+    if (code == g_lastLoggedCurlCode) return;
+    ZLOG(ZEPA_LOG_ERR, "curl error: %d, %s", code, curl_easy_strerror(static_cast<CURLcode>(code)));
+    g_lastLoggedCurlCode = code;
+}
+
+ALIAS_RET ClassifyCurlCode(int code) {
+    switch (code) {
+        case CURLE_COULDNT_RESOLVE_HOST:
+            return ALIAS_RET_DNS;
+        case CURLE_COULDNT_CONNECT:
+        case CURLE_OPERATION_TIMEDOUT:
+        case CURLE_SSL_CONNECT_ERROR:
+        case CURLE_SEND_ERROR:
+        case CURLE_RECV_ERROR:
+        case CURLE_AGAIN:
+            return ALIAS_RET_NETWORK;
+        default:
+            return ALIAS_RET_UNKNOWN;
+    }
+}
+
+// A JSON object answer, parsed with comments off.
+bool ParseJsonObject(const std::string& text, Json::Value& out) {
+    Json::Value parsed;
+    Json::Reader reader;
+    if (!reader.parse(text, parsed, false) || !parsed.isObject()) return false;
+    out = parsed;
+    return true;
+}
+
+}  // namespace
+
+bool AliasRequest::ParseCURLHttp(HTTPResponse& r, ALIAS_RET& ret, std::string& body, int& httpStatus) {
+    if (r.curlCode != CURLE_OK) {
+        LogCurlError(r.curlCode);
+        ret = ClassifyCurlCode(r.curlCode);
+        return false;
+    }
+    g_lastLoggedCurlCode = 0;
+
+    Trim(r.body);
+    ZLOG(ZEPA_LOG_DEBUG, "HTTP: %d, Response: %s", r.httpStatus, r.body.c_str());
+    httpStatus = r.httpStatus;
+    if (r.httpStatus == 200) {
+        body = r.body;
+        return true;
+    }
+    // Every other status, 404 and 5xx included, ends as unknown; callers rely on it.
+    ZLOG(ZEPA_LOG_ERR, "http status: %d", r.httpStatus);
+    ret = ALIAS_RET_UNKNOWN;
+    return false;
+}
+
+bool AliasRequest::ParseCURLHttp(boost::shared_ptr<Request> req, ALIAS_RET& ret, std::string& body) {
+    HTTPResponse r(req->GetHttpStatus(), req->GetResponse(), req->GetCurlResult());
+    int ignoredStatus = -1;
+    return ParseCURLHttp(r, ret, body, ignoredStatus);
+}
+
+bool AliasRequest::ParseCURLHttp(ALIAS_RET& ret, std::string& body, int& httpStatus) {
+    HTTPResponse r(_request.GetHttpStatus(), _request.GetResponse(), _request.GetCurlResult());
+    return ParseCURLHttp(r, ret, body, httpStatus);
+}
+
+bool AliasRequest::Send(ALIAS_RET& ret, ALIAS_RESPONSE_TYPE& type) {
+    ALIAS_RET code = ALIAS_RET_UNKNOWN;
+    int status = -1;
+    std::string body;
+
+    if (!_request.IsValid()) {
+        ZLOG(ZEPA_LOG_ERR, "No valid request found!! Please call SetRequest() first");
+        return false;
+    }
+    _request.Send();
+    const bool answered = ParseCURLHttp(code, body, status);
+    type = ALIAS_RESP_NONE;
+    ret = code;
+    _responseCode = status;
+    // The exchange took place; the failure is in ret.
+    if (!answered) return true;
+
+    type = ALIAS_RESP_TEXT;
+    _responseText = body;
+    Json::Value object;
+    if (ParseJsonObject(body, object)) {
+        type = ALIAS_RESP_JSON;
+        _responseJson = object;
+        ret = ALIAS_RET_SUCCESS;
+        return true;
+    }
+    if (ParseServerResponse(body, ret)) return true;
+    ret = ALIAS_RET_UNKNOWN;
+    return false;
+}
+
+bool AliasRequest::Send(ALIAS_RET& ret) {
+    ALIAS_RESPONSE_TYPE ignored = ALIAS_RESP_NONE;
+    return Send(ret, ignored);
+}
+
+bool AliasRequest::GetResponseForDaemon(boost::shared_ptr<Request> req, ALIAS_RET& ret, std::string& detail) {
+    ALIAS_RET code = ALIAS_RET_SUCCESS;
+    std::string body;
+    if (!ParseCURLHttp(req, code, body)) {
+        ret = code;
+        return false;
+    }
+    if (!ParseServerResponse(body, code)) {
+        ZLOG(ZEPA_LOG_ERR, "Unknown response: %s", body.c_str());
+        return false;
+    }
+    const std::string::size_type colon = body.find(':');
+    if (colon != std::string::npos) detail = body.substr(colon + 1);
+    ret = code;
+    return true;
+}
+
+bool AliasRequest::GetAliasName(boost::shared_ptr<Request> req, std::string& alias) {
+    const std::string& data = req->GetData();
+    std::istringstream pieces(data);
+    std::string piece;
+    while (std::getline(pieces, piece, '&')) {
+        if (piece.compare(0, 6, "alias=") != 0) continue;
+        // The second "="-separated piece, percent-encoding left as it is.
+        const std::string value = piece.substr(6);
+        alias = value.substr(0, value.find('='));
+        return true;
+    }
+    ZLOG(ZEPA_LOG_ERR, "not found alias name from post data [%s]", data.c_str());
+    return false;
+}
+
+void AliasRequest::GetResponse(int& code) const { code = _responseCode; }
+
+void AliasRequest::GetResponse(std::string& text) const { text = _responseText; }
+
+void AliasRequest::GetResponse(Json::Value& value) const { value = _responseJson; }
+
+}  // namespace Relay
+}  // namespace ZEPA
