@@ -16,7 +16,7 @@ namespace ZEPA {
 namespace Relay {
 
 // The command given to AliasRequest::SetRequest.
-enum ALIAS_REQUEST_CMD {
+enum ALIAS_REQUEST_CMD : int {
     ALIAS_REQ_NONE = 0,
     ALIAS_REQ_MAP = 1,
     ALIAS_REQ_DELETE = 2,
@@ -26,7 +26,8 @@ enum ALIAS_REQUEST_CMD {
 };
 
 // Outcome of an alias operation. The numbers are stored by callers: never renumber.
-enum ALIAS_RET {
+// A fixed int type, so that any code a caller hands in can be looked up safely.
+enum ALIAS_RET : int {
     ALIAS_RET_SUCCESS = 1,
     ALIAS_RET_NOT_FOUND = 2,
     ALIAS_RET_INUSED = 3,
@@ -45,7 +46,7 @@ enum ALIAS_RET {
 };
 
 // How the caller should retry after an outcome; the waiting times are the caller's.
-enum ALIAS_RETRY_TYPE {
+enum ALIAS_RETRY_TYPE : int {
     ALIAS_RETRY_NONE = 0,
     ALIAS_RETRY_RESOLVE = 1,
     ALIAS_RETRY_NORMAL = 2,
@@ -53,7 +54,7 @@ enum ALIAS_RETRY_TYPE {
 };
 
 // What kind of answer the last Send got.
-enum ALIAS_RESPONSE_TYPE {
+enum ALIAS_RESPONSE_TYPE : int {
     ALIAS_RESP_JSON = 1,
     ALIAS_RESP_TEXT = 2,
     ALIAS_RESP_NONE = 3,
