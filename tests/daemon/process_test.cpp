@@ -2,6 +2,7 @@
 #include <libdaemon/dlog.h>
 #include <libdaemon/dpid.h>
 #include <libdaemon/dsignal.h>
+#include <sys/resource.h>
 #include <sys/wait.h>
 #include <unistd.h>
 #include <zepasdk/sysroot.h>
@@ -226,6 +227,28 @@ TEST_F(ProcessTest, ParentThatGetsNoWordExitsWith255) {
     EXPECT_EQ(255, ExitCode(status));
     EXPECT_TRUE(zepatest::LogContains(LauncherLog(), "Could not recieve return value from daemon process: "));
     EXPECT_TRUE(zepatest::LogContains(LauncherLog(), " zeparelayd returned -1"));
+}
+
+TEST_F(ProcessTest, WithoutDescriptorsForThePipeInitFailsWithoutForking) {
+    int status = RunInChild([&] {
+        StderrTo("/launcher.log");
+        Daemon::SetName("zeparelayd");
+        // Use up every descriptor so that the start-up pipe cannot be made.
+        rlimit limit = {64, 64};
+        setrlimit(RLIMIT_NOFILE, &limit);
+        while (open("/dev/null", O_RDONLY) >= 0) {
+        }
+        bool started = Daemon::Init(true);
+        return started ? 1 : 0;
+    });
+    EXPECT_EQ(0, ExitCode(status));
+    // libdaemon adds lines of its own; the library logs exactly one.
+    std::vector<std::string> ours;
+    for (const std::string& line : zepatest::LogMessages(LauncherLog()))
+        if (line.compare(0, 7, "daemon:") == 0) ours.push_back(line);
+    ASSERT_EQ(1u, ours.size()) << LauncherLog();
+    EXPECT_NE(std::string::npos, ours[0].find(" Failed to create pipe."));
+    EXPECT_FALSE(root.exists("/var/run/zeparelayd.pid"));
 }
 
 TEST_F(ProcessTest, EachDaemonStartBeginsAFreshLogFile) {
