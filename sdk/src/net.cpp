@@ -78,8 +78,11 @@ bool ListInterfaces(std::vector<Interface>& out) {
     if (getifaddrs(&list) != 0) return false;
     std::map<std::string, Interface> byName;
     for (const struct ifaddrs* ifa = list; ifa != nullptr; ifa = ifa->ifa_next) {
-        Interface& itf = byName[ifa->ifa_name];
-        itf.name = ifa->ifa_name;
+        // An address label ("eth0:1") belongs to its interface.
+        std::string name = ifa->ifa_name;
+        name = name.substr(0, name.find(':'));
+        Interface& itf = byName[name];
+        itf.name = name;
         itf.flags = ifa->ifa_flags;
         if (ifa->ifa_addr == nullptr) continue;
         if (ifa->ifa_addr->sa_family == AF_PACKET) {

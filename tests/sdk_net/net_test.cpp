@@ -196,6 +196,16 @@ TEST_F(PrivateNetTest, FirstIpv4AddressIsReported) {
     EXPECT_STREQ("10.9.8.7", rec->szIP);
 }
 
+TEST_F(PrivateNetTest, LabelledAddressesBelongToTheirInterface) {
+    if (!Cable()) GTEST_SKIP() << "cannot create veth interfaces";
+    ASSERT_TRUE(Shell("ip addr add 10.1.1.1/24 dev zn0 label zn0:1"));
+    std::vector<VLIBNetIfInfo> all = Interfaces(0x3f);
+    EXPECT_EQ(nullptr, Find(all, "zn0:1"));
+    ASSERT_NE(nullptr, Find(all, "zn0"));
+    EXPECT_STREQ("10.9.8.7", Find(all, "zn0")->szIP);
+    EXPECT_EQ(3u, all.size());
+}
+
 TEST_F(PrivateNetTest, BridgesAreWiredButNotPorts) {
     if (!Shell("ip link add zbr0 type bridge")) GTEST_SKIP() << "cannot create a bridge";
     std::vector<VLIBNetIfInfo> bridges = Interfaces(VLIBNET_SEL_BRIDGE_BOND);
