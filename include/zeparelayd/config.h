@@ -268,6 +268,11 @@ public:
     // Set with a new serverID; cleared by the next successful file write,
     // which sends the administrators' notice.
     bool serverIdChanged;
+
+private:
+    void OverwriteServices(const Json::Value& list);
+    void TakeOver(const RelaydConf& other);
+    bool BeginFieldWrite(const std::string& path, std::string& file, Json::Value& value) const;
 };
 
 }  // namespace Relay
