@@ -1,0 +1,32 @@
+#include <gtest/gtest.h>
+#include <zepasdk/fw.h>
+
+#include <zeparelayd/config.h>
+
+#include "support/service_staging.h"
+#include "support/test_support.h"
+
+// Stands in for the firewall layer's lookup: whatever is asked, a definition
+// whose name is empty.
+extern "C" PZEPAFwService ZEPAFWServiceFind(PZEPAFwService /*pList*/, const char* /*szName*/) {
+    static ZEPAFwService unnamed = {};
+    unnamed.dwTcp = 1;
+    return &unnamed;
+}
+
+namespace {
+
+class UnnamedDefinitionTest : public zepatest::RootTest {};
+
+TEST_F(UnnamedDefinitionTest, DefinitionWithoutNameAborts) {
+    GTEST_FLAG_SET(death_test_style, "threadsafe");
+    zepatest::WriteStockFwDefinitions(root);
+    EXPECT_DEATH(ZEPA::Relay::ServiceConf("nos"), "Assertion .'.0' != \\*\\(pService->szName\\)' failed");
+}
+
+TEST_F(UnnamedDefinitionTest, NoDefinitionsFailsBeforeTheLookup) {
+    ZEPA::Relay::ServiceConf s("nos");
+    EXPECT_FALSE(s.IsValid());
+}
+
+}  // namespace
