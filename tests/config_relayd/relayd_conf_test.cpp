@@ -384,6 +384,20 @@ TEST_F(RelaydConfTest, ReloadKeepsRuntimeServersAndIdentity) {
     EXPECT_EQ(conf(), c.path);
 }
 
+TEST_F(RelaydConfTest, ReloadReadsTheNetworkStateFromTheSystem) {
+    WriteConf("{}");
+    RelaydConf c(conf().c_str());
+    EXPECT_TRUE(c.network.interfaces.empty());
+    c.network.gateway = "stale";
+    c.network.mode = "kept";
+    ASSERT_TRUE(c.Reload());
+    NetworkConf live(true);
+    EXPECT_TRUE(c.network == live);
+    EXPECT_EQ(live.interfaces.size(), c.network.interfaces.size());
+    EXPECT_NE("stale", c.network.gateway);
+    EXPECT_EQ("kept", c.network.mode);
+}
+
 TEST_F(RelaydConfTest, ReloadAlwaysUsesTheDefaultFile) {
     root.write("/elsewhere/relayd.conf", R"({"serverID": "elsewhere"})");
     RelaydConf c(root.path("/elsewhere/relayd.conf").c_str());
