@@ -3,6 +3,7 @@
 
 #include <zeparelayd/daemon.h>
 #include <zeparelayd/request_alias.h>
+#include <boost/shared_ptr.hpp>
 #include <string>
 
 #include "support/test_support.h"
@@ -138,4 +139,14 @@ TEST_F(ClassifyTest, HttpStatusLinesAreLoggedEveryTime) {
     Outcome second = Classify(CURLE_OK, 500, "");
     EXPECT_TRUE(LogContains(first.log, "http status: 500"));
     EXPECT_TRUE(LogContains(second.log, "http status: 500"));
+}
+
+TEST_F(ClassifyTest, NullRequestIsAProgrammingError) {
+#ifdef NDEBUG
+    GTEST_SKIP() << "the shared pointer's assertion is compiled out";
+#else
+    ALIAS_RET ret = ALIAS_RET_NOT_SET;
+    std::string body;
+    EXPECT_DEATH(AliasRequest::ParseCURLHttp(boost::shared_ptr<Request>(), ret, body), "px != 0");
+#endif
 }

@@ -569,3 +569,17 @@ TEST_F(AliasExchangeTest, ParseOfTheDaemonsRequestDropsTheStatus) {
     EXPECT_EQ(ALIAS_RET_NOT_SET, ret);
     EXPECT_EQ("good:fine", body);
 }
+
+TEST_F(AliasExchangeTest, AliasNameMissingKeepsCredentialsOutOfTheLog) {
+    auto req = boost::make_shared<Request>(
+        server.httpUrl(kUpdate).c_str(), "action=x&key=k1&token=t1&myhub_password=p1&auth_key=a1&keys=v&id=i",
+        true);
+    std::string alias;
+    StderrCapture capture;
+    EXPECT_FALSE(AliasRequest::GetAliasName(req, alias));
+    const std::string log = capture.stop();
+    EXPECT_TRUE(LogContains(log,
+                            " not found alias name from post data "
+                            "[action=x&key=***&token=***&myhub_password=***&auth_key=***&keys=v&id=i]"))
+        << log;
+}
