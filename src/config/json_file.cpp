@@ -55,7 +55,10 @@ bool RelaydConf::WriteJsonFile(const std::string& path, const Json::Value& value
         return true;
     }
     const std::string tmp = path + ".tmp." + std::to_string(getpid());
-    std::ofstream out(tmp.c_str(), std::ios::out | std::ios::trunc);
+    // An empty target names no file: its temporary file is never created in
+    // whatever folder the process happens to run in.
+    std::ofstream out;
+    if (!path.empty()) out.open(tmp.c_str(), std::ios::out | std::ios::trunc);
     if (!out.is_open()) {
         ZLOG(ZEPA_LOG_ERR, "open failed [%s]", tmp.c_str());
         unlink(tmp.c_str());

@@ -137,6 +137,20 @@ TEST_F(JsonFileTest, WriteIntoMissingDirectoryFailsAtOpen) {
     EXPECT_TRUE(LogContains(log, "open failed [" + path + ".tmp." + std::to_string(getpid()) + "]")) << log;
 }
 
+TEST_F(JsonFileTest, EmptyPathFailsAtTheOpenEvenInAWritableFolder) {
+    root.mkdir("/work");
+    char saved[4096];
+    ASSERT_NE(nullptr, getcwd(saved, sizeof(saved)));
+    ASSERT_EQ(0, chdir(root.path("/work").c_str()));
+    StderrCapture cap;
+    bool ok = RelaydConf::WriteJsonFile("", Json::Value(1));
+    std::string log = cap.stop();
+    ASSERT_EQ(0, chdir(saved));
+    EXPECT_FALSE(ok);
+    EXPECT_TRUE(LogContains(log, "open failed [.tmp." + std::to_string(getpid()) + "]")) << log;
+    EXPECT_FALSE(root.exists("/work/.tmp." + std::to_string(getpid())));
+}
+
 TEST_F(JsonFileTest, FailedRenameIsLoggedButReportedTrue) {
     std::string path = root.path("/conf/target");
     zepatest::MakeDirs(path + "/occupied");  // a non-empty folder cannot be replaced
