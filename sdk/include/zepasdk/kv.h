@@ -52,17 +52,17 @@ ZEPASDK_API void VLIBCErrSet(int code);
 /* ---- string lists ------------------------------------------------------- */
 
 typedef struct VLIBCSzList {
-    int nAlloc;       /* capacity of pszItem */
-    int nItem;        /* number of items */
-    char **pszItem;   /* the items, owned by the list */
+    int nAlloc;     /* capacity of pszItem */
+    int nItem;      /* number of items */
+    char** pszItem; /* the items, owned by the list */
 } VLIBCSzList, *PVLIBCSzList;
 
 /* A new empty list with room for capacity items (at least 1); NULL on failure. */
 ZEPASDK_API PVLIBCSzList VLIBCSzListAlloc(int capacity);
 /* Appends a copy of item, growing the list (*list may be replaced). 0 or -1. */
-ZEPASDK_API int VLIBCSzListPush(PVLIBCSzList *list, const char *item);
+ZEPASDK_API int VLIBCSzListPush(PVLIBCSzList* list, const char* item);
 /* The index-th item, or NULL when index is out of range or list is NULL. */
-ZEPASDK_API const char *VLIBCSzListGet(const VLIBCSzList *list, int index);
+ZEPASDK_API const char* VLIBCSzListGet(const VLIBCSzList* list, int index);
 /* Frees the list and its items; NULL is accepted. */
 ZEPASDK_API void VLIBCSzListFree(PVLIBCSzList list);
 
@@ -73,37 +73,37 @@ ZEPASDK_API void VLIBCSzListFree(PVLIBCSzList list);
  * > 0: the length written; 0: the key is missing or its value is empty
  * (ZEPA_ERR_KEY_NOT_FOUND when missing); -1: the file cannot be read
  * (ZEPA_ERR_FILE_NOT_FOUND) or bad arguments (ZEPA_ERR_BAD_PARAMETERS). */
-ZEPASDK_API int VLIBCFileGetKeyValue(const char *file, const char *key, char *buf, int size);
+ZEPASDK_API int VLIBCFileGetKeyValue(const char* file, const char* key, char* buf, int size);
 
 /* 1 when key holds value (compared without regard to case), else 0.
  * opt 1: a missing key (or a missing file) counts as holding value, i.e. value
  * is the key's default. opt 0: a missing key or file is no match.
  * -1 on bad arguments. */
-ZEPASDK_API int VLIBCFileCheckKeyValue(const char *file, const char *key, const char *value, int opt);
+ZEPASDK_API int VLIBCFileCheckKeyValue(const char* file, const char* key, const char* value, int opt);
 
 /* Sets key="value" (outside any section), adding the key at the end when
  * missing, creating the file when absent. 0 on success, -1 on failure. */
-ZEPASDK_API int VLIBCFileSetKeyValue(const char *file, const char *key, const char *value);
+ZEPASDK_API int VLIBCFileSetKeyValue(const char* file, const char* key, const char* value);
 
 /* VLIBCFileSetKeyValue on the system's main key/value file "/etc/zepainfo.conf"
  * under the system root. 0 on success, -1 on failure. */
-ZEPASDK_API int VLIBCINFOSetKeyValue(const char *key, const char *value);
+ZEPASDK_API int VLIBCINFOSetKeyValue(const char* key, const char* value);
 
 /* Appends the names of the sections of file, in file order, to *list (which
  * may grow). The number of sections (0 when none), or -1 when the file cannot
  * be read or on bad arguments. */
-ZEPASDK_API int VLIBCFileEnumSection(const char *file, PVLIBCSzList *list);
+ZEPASDK_API int VLIBCFileEnumSection(const char* file, PVLIBCSzList* list);
 
 /* Reads key of section into buf, as VLIBCFileGetKeyValue.
  * > 0 length; 0 key missing or empty; -1 file unreadable, section missing
  * (ZEPA_ERR_SECTION_NOT_FOUND) or bad arguments. */
-ZEPASDK_API int VLIBCFileGetSectionValue(const char *file, const char *section, const char *key, char *buf,
+ZEPASDK_API int VLIBCFileGetSectionValue(const char* file, const char* section, const char* key, char* buf,
                                          int size);
 
 /* Sets key="value" in section, creating the section (at the end) and the file
  * when missing. 0 or -1. */
-ZEPASDK_API int VLIBCFileSetSectionValue(const char *file, const char *section, const char *key,
-                                         const char *value);
+ZEPASDK_API int VLIBCFileSetSectionValue(const char* file, const char* section, const char* key,
+                                         const char* value);
 
 /* ---- programs ------------------------------------------------------------ */
 
@@ -112,7 +112,7 @@ ZEPASDK_API int VLIBCFileSetSectionValue(const char *file, const char *section, 
  * shell, and waits for it. Standard input is /dev/null.
  * The exit status (0-255), 128 + the signal number when it was killed, or -1
  * when it could not be started (ZEPA_ERR_EXEC). */
-ZEPASDK_API int VLIBCExec(const char *path, ...);
+ZEPASDK_API int VLIBCExec(const char* path, ...);
 
 #ifdef __cplusplus
 }

@@ -99,8 +99,8 @@ struct ZEPAV6IPInfo {
 
 /* Fills up to max IPv6 address records of interface ifname, in the kernel's
  * order. The name "pppoe" stands for the PPPoE link's device (see
- * ZEPAPPPoECheckStatus) unless an interface of that very name exists. The number of records (0 when it has none or IPv6 is off); -1 when
- * no interface of that name exists (ZEPA_ERR_NOT_FOUND) or on bad arguments. */
+ * ZEPAPPPoECheckStatus) unless an interface of that very name exists. The number of records (0 when it has
+ * none or IPv6 is off); -1 when no interface of that name exists (ZEPA_ERR_NOT_FOUND) or on bad arguments. */
 ZEPASDK_API int ZEPALnxV6IPGet(const char* ifname, struct ZEPAV6IPInfo* list, int max);
 
 /* 1 when ip and mask form a usable IPv4 host address/netmask pair, else 0:
