@@ -446,4 +446,78 @@ TEST_F(StatusTest, TwoQueriesAtOnceOneIsBusyAtOnce) {
     EXPECT_TRUE(daemon.NothingReported());
 }
 
+TEST_F(StatusTest, StatusDebugPrintsTheDumpOnOneLine) {
+    StandInDaemon daemon;
+    WritePidFile(daemon.pid());
+    g_waitFor = DebugFile(daemon.pid());
+    ZEPA::Relay::g_statusSleep = WaitForDump;
+    zepatest::StdoutCapture capture;
+    int ret = Daemon::Status(true);
+    std::string printed = capture.stop();
+    EXPECT_EQ(0, ret);
+    EXPECT_EQ("{\"dumps\":1,\"pid\":" + std::to_string(daemon.pid()) + "}\n", printed);
+}
+
+TEST_F(StatusTest, StatusDebugWithoutDaemonPrintsFailure) {
+    zepatest::StdoutCapture capture;
+    int ret = Daemon::Status(true);
+    EXPECT_EQ("get status failed\n", capture.stop());
+    EXPECT_EQ(1, ret);
+}
+
+class StatusReportTest : public StatusTest {
+protected:
+    void SetUp() override {
+        StatusTest::SetUp();
+        root.write("/usr/zepa/etc/zeparelayd/zeparelayd.conf",
+                   "{\"serverID\": \"conf-id\", \"server_alias\": {\"alias\": \"myhome\"}}");
+        root.write("/tmp/hopcloud_alias.status",
+                   "{\"alias_name\": \"myhome\", \"status\": \"registered\", \"extra\": \"hidden\"}");
+    }
+    int Report(std::string& printed) {
+        zepatest::StdoutCapture capture;
+        int ret = Daemon::Status(false);
+        printed = capture.stop();
+        return ret;
+    }
+};
+
+TEST_F(StatusReportTest, WithoutStatusFileFourLinesAndNotRunning) {
+    std::string printed;
+    EXPECT_EQ(1, Report(printed));
+    EXPECT_EQ("serverID: \nstate: not_running\nalias: myhome\nalias_status: registered\n", printed);
+}
+
+TEST_F(StatusReportTest, BrokenStatusFilePrintsFailureAndGivesTwo) {
+    WriteStatus("{\"pid\": ");
+    std::string printed;
+    EXPECT_EQ(2, Report(printed));
+    EXPECT_EQ("get status failed\n", printed);
+}
+
+TEST_F(StatusReportTest, RunningDaemonWithAnErrorGetsAFifthLine) {
+    StandInDaemon daemon;
+    WriteStatus(StatusWithPid(daemon.pid(), ", \"serverID\": \"abc\", \"state\": 5, \"error\": 8"));
+    std::string printed;
+    EXPECT_EQ(0, Report(printed));
+    EXPECT_EQ("serverID: abc\nstate: connected\nalias: myhome\nalias_status: registered\nerror: err_auth\n",
+              printed);
+}
+
+TEST_F(StatusReportTest, RunningDaemonWithoutErrorAndAnotherAliasInTheStatus) {
+    StandInDaemon daemon;
+    WriteStatus(StatusWithPid(daemon.pid(), ", \"serverID\": \"abc\", \"state\": 3, \"error\": 0"));
+    root.write("/tmp/hopcloud_alias.status", "{\"alias_name\": \"other\", \"status\": \"registered\"}");
+    std::string printed;
+    EXPECT_EQ(0, Report(printed));
+    EXPECT_EQ("serverID: abc\nstate: login\nalias: myhome\nalias_status: \n", printed);
+}
+
+TEST_F(StatusReportTest, StaleStatusFileReportsItsServerIdAsNotRunning) {
+    WriteStatus(StatusWithPid(DeadPid(), ", \"serverID\": \"abc\", \"state\": 5, \"error\": 8"));
+    std::string printed;
+    EXPECT_EQ(1, Report(printed));
+    EXPECT_EQ("serverID: abc\nstate: not_running\nalias: myhome\nalias_status: registered\n", printed);
+}
+
 }  // namespace

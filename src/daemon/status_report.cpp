@@ -1,0 +1,63 @@
+// Status(false): the command-line report of the daemon's state and alias.
+#define ZEPA_LOG_SOURCE "daemon"
+
+#include <json/writer.h>
+
+#include <iostream>
+#include <string>
+
+#include <zeparelayd/config.h>
+#include <zeparelayd/config_alias.h>
+
+#include "common/log.h"
+#include "common/paths.h"
+#include "daemon/status_file.h"
+
+namespace ZEPA {
+namespace Relay {
+
+namespace {
+
+const int RUNNING = 0;
+
+void PrintLine(const char* label, const std::string& value) { std::cout << label << value << std::endl; }
+
+}  // namespace
+
+int PrintStatusReport() {
+    AliasStatus aliasStatus;
+    const std::string confPath = Paths::Resolve(Paths::RELAYD_CONF);
+    RelaydConf conf(confPath.c_str());
+    std::string serverId, state, error;
+    if (!Daemon::GetStatus(serverId, state, error, nullptr)) {
+        std::cout << "get status failed" << std::endl;
+        return 2;
+    }
+    const std::string aliasName = conf.alias.GetAliasName();
+    std::string aliasWord, unused;
+    aliasStatus.GetStatus(aliasName, aliasWord, unused);
+    PrintLine("serverID: ", serverId);
+    PrintLine("state: ", state);
+    PrintLine("alias: ", aliasName);
+    PrintLine("alias_status: ", aliasWord);
+    if (error != "success") PrintLine("error: ", error);
+    return state == "not_running" ? 1 : 0;
+}
+
+int Daemon::Status(bool debug) {
+    if (debug) {
+        Json::Value dump;
+        int ret = DebugStatus(dump);
+        if (ret == RUNNING) {
+            Json::FastWriter writer;
+            std::cout << writer.write(dump) << std::flush;
+        } else {
+            std::cout << "get status failed" << std::endl;
+        }
+        return ret;
+    }
+    return PrintStatusReport();
+}
+
+}  // namespace Relay
+}  // namespace ZEPA
