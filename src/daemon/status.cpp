@@ -132,12 +132,13 @@ bool Daemon::GetStatus(std::string& serverId, std::string& state, std::string& e
     error.clear();
     Json::Value status;
     int probe = GetStatus(status);
-    if (status.isObject() && status["serverID"].isString()) serverId = status["serverID"].asString();
-    int stateNo = IntMember(status, "state", STATE_NOT_RUNNING);
-    int errorNo = IntMember(status, "error", ERROR_NONE);
+    const Json::Value& file = status;
+    if (file.isObject() && file["serverID"].isString()) serverId = file["serverID"].asString();
+    int stateNo = IntMember(file, "state", STATE_NOT_RUNNING);
+    int errorNo = IntMember(file, "error", ERROR_NONE);
     if (probe == BROKEN) return false;
     // A stale file or a service not relayed both read as "not running".
-    bool relayed = probe == RUNNING && (serviceId == nullptr || RelaysService(status, serviceId));
+    bool relayed = probe == RUNNING && (serviceId == nullptr || RelaysService(file, serviceId));
     if (!relayed) {
         stateNo = STATE_NOT_RUNNING;
         errorNo = ERROR_NONE;
