@@ -24,6 +24,19 @@ std::string Daemon::_strLogFile;
 // Seam for the time-stamp conversion, so that a failing ctime_r can be shown.
 char* (*g_logCtime)(const time_t*, char*) = ctime_r;
 
+namespace {
+
+// libdaemon complains "not a valid priority value" for every level but 7 (its
+// check masks wrongly); the level is stored all the same, so silence it.
+void SetDaemonVerbosity(int level) {
+    int savedUse = daemon_log_use;
+    daemon_log_use = static_cast<daemon_log_flags>(0);
+    daemon_set_verbosity(level);
+    daemon_log_use = static_cast<daemon_log_flags>(savedUse);
+}
+
+}  // namespace
+
 bool Daemon::IsLogEnable(int level) { return _logLevel >= level; }
 
 void Daemon::Log(int level, const char* format, ...) {
@@ -71,7 +84,7 @@ bool Daemon::OpenLogFile(const std::string& path, int fd, int flags) {
 bool Daemon::SetLogFile(const std::string& path, int level) {
     if (level >= 0) {
         _logLevel = level;
-        daemon_set_verbosity(level);
+        SetDaemonVerbosity(level);
     }
     _strLogFile = path;
     if (!IsForked()) return true;

@@ -1,5 +1,6 @@
 #include "daemon_fixture.h"
 
+#include <poll.h>
 #include <sys/prctl.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -130,6 +131,9 @@ StandInDaemon::~StandInDaemon() {
 }
 
 int StandInDaemon::NextSignal() {
+    // Bounded, so that a signal that never comes fails the test instead of hanging it.
+    pollfd pfd{_reports, POLLIN, 0};
+    if (poll(&pfd, 1, 30000) != 1) return 0;
     int sig = 0;
     if (read(_reports, &sig, sizeof(sig)) != sizeof(sig)) return 0;
     return sig;

@@ -106,6 +106,15 @@ TEST_F(LogTest, SetLogFileBeforeDaemonisingOnlyRecords) {
     EXPECT_FALSE(root.exists("/var/log/zeparelayd.log"));
 }
 
+TEST_F(LogTest, SettingAnyLevelPrintsNothing) {
+    for (int level : {0, 3, 4, 5, 6, 7}) {
+        StderrCapture cap;
+        EXPECT_TRUE(Daemon::SetLogFile("", level));
+        EXPECT_EQ("", cap.stop()) << level;
+        EXPECT_EQ(level, Daemon::_logLevel);
+    }
+}
+
 TEST_F(LogTest, OpenLogFileInMissingDirectoryKeepsStderr) {
     std::string path = root.path("/no/dir/x.log");
     StderrCapture cap;
