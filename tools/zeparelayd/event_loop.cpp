@@ -1,0 +1,183 @@
+#define ZEPA_LOG_SOURCE "loop"
+
+#include "event_loop.h"
+
+#include <libdaemon/dsignal.h>
+#include <poll.h>
+#include <time.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <climits>
+#include <vector>
+
+#include "common/log.h"
+
+using ZEPA::Relay::Request;
+
+namespace zeparelayd {
+
+int64_t NowMs() {
+    timespec ts{};
+    clock_gettime(CLOCK_MONOTONIC, &ts);
+    return static_cast<int64_t>(ts.tv_sec) * 1000 + ts.tv_nsec / 1000000;
+}
+
+EventLoop::EventLoop() : _multi(curl_multi_init()), _curlDueMs(-1), _running(false) {
+    if (_multi == nullptr) return;
+    curl_multi_setopt(_multi, CURLMOPT_SOCKETFUNCTION, &EventLoop::SocketCallback);
+    curl_multi_setopt(_multi, CURLMOPT_SOCKETDATA, this);
+    curl_multi_setopt(_multi, CURLMOPT_TIMERFUNCTION, &EventLoop::TimerCallback);
+    curl_multi_setopt(_multi, CURLMOPT_TIMERDATA, this);
+}
+
+EventLoop::~EventLoop() {
+    for (Job& job : _jobs) job.request->JobRemove(_multi);
+    _jobs.clear();
+    if (_multi != nullptr) curl_multi_cleanup(_multi);
+}
+
+int EventLoop::SocketCallback(CURL*, curl_socket_t fd, int what, void* userp, void*) {
+    auto* self = static_cast<EventLoop*>(userp);
+    if (what == CURL_POLL_REMOVE) {
+        self->_sockets.erase(fd);
+    } else {
+        self->_sockets[fd] = what;
+    }
+    return 0;
+}
+
+int EventLoop::TimerCallback(CURLM*, long timeoutMs, void* userp) {
+    auto* self = static_cast<EventLoop*>(userp);
+    self->_curlDueMs = timeoutMs < 0 ? -1 : NowMs() + timeoutMs;
+    return 0;
+}
+
+void EventLoop::SetTimer(const std::string& name, int64_t delayMs, TimerHandler handler) {
+    _timers[name] = Timer{NowMs() + std::max<int64_t>(delayMs, 0), std::move(handler)};
+}
+
+void EventLoop::CancelTimer(const std::string& name) { _timers.erase(name); }
+
+int64_t EventLoop::TimerRemaining(const std::string& name) const {
+    auto it = _timers.find(name);
+    if (it == _timers.end()) return -1;
+    return std::max<int64_t>(it->second.dueMs - NowMs(), 0);
+}
+
+bool EventLoop::StartRequest(const std::string& tag, boost::shared_ptr<Request> request,
+                             RequestHandler handler) {
+    if (!request || !request->JobAdd(_multi)) return false;
+    _jobs.push_back(Job{tag, request, std::move(handler), NowMs()});
+    // JobAdd kicked the transfer; it may already have finished (refused at once).
+    CollectFinished();
+    return true;
+}
+
+void EventLoop::CancelRequests(const std::string& tag) {
+    for (auto it = _jobs.begin(); it != _jobs.end();) {
+        if (it->tag == tag) {
+            it->request->JobRemove(_multi);
+            it = _jobs.erase(it);
+        } else {
+            ++it;
+        }
+    }
+}
+
+bool EventLoop::HasRequest(const std::string& tag) const {
+    return std::any_of(_jobs.begin(), _jobs.end(), [&](const Job& j) { return j.tag == tag; });
+}
+
+int EventLoop::PollTimeout() const {
+    int64_t due = _curlDueMs;
+    for (const auto& t : _timers) {
+        if (due < 0 || t.second.dueMs < due) due = t.second.dueMs;
+    }
+    if (due < 0) return -1;
+    int64_t wait = due - NowMs();
+    if (wait <= 0) return 0;
+    return static_cast<int>(std::min<int64_t>(wait, INT_MAX));
+}
+
+bool EventLoop::Run() {
+    _running = true;
+    while (_running) {
+        std::vector<pollfd> fds;
+        fds.push_back(pollfd{daemon_signal_fd(), POLLIN, 0});
+        for (const auto& s : _sockets) {
+            short events = 0;
+            if (s.second & CURL_POLL_IN) events |= POLLIN;
+            if (s.second & CURL_POLL_OUT) events |= POLLOUT;
+            fds.push_back(pollfd{s.first, events, 0});
+        }
+        int n = poll(fds.data(), fds.size(), PollTimeout());
+        if (n < 0 && errno != EINTR) {
+            ZLOG(ZEPA_LOG_ERR, "poll failed (%d)", errno);
+            return false;
+        }
+        if (n > 0 && (fds[0].revents & POLLIN)) DrainSignals();
+        for (size_t i = 1; n > 0 && _running && i < fds.size(); ++i) {
+            if (fds[i].revents == 0) continue;
+            int mask = 0;
+            if (fds[i].revents & POLLIN) mask |= CURL_CSELECT_IN;
+            if (fds[i].revents & POLLOUT) mask |= CURL_CSELECT_OUT;
+            if (fds[i].revents & (POLLERR | POLLHUP | POLLNVAL)) mask |= CURL_CSELECT_ERR;
+            SocketAction(fds[i].fd, mask);
+        }
+        if (_running && _curlDueMs >= 0 && _curlDueMs <= NowMs()) {
+            _curlDueMs = -1;
+            SocketAction(CURL_SOCKET_TIMEOUT, 0);
+        }
+        if (_running) RunDueTimers();
+    }
+    return true;
+}
+
+void EventLoop::DrainSignals() {
+    int sig;
+    while (_running && (sig = daemon_signal_next()) > 0) {
+        if (_onSignal) _onSignal(sig);
+    }
+}
+
+void EventLoop::SocketAction(curl_socket_t fd, int mask) {
+    int running = 0;
+    curl_multi_socket_action(_multi, fd, mask, &running);
+    CollectFinished();
+}
+
+void EventLoop::CollectFinished() {
+    int left = 0;
+    CURLMsg* msg;
+    while ((msg = curl_multi_info_read(_multi, &left)) != nullptr) {
+        if (msg->msg != CURLMSG_DONE) continue;
+        auto it = std::find_if(_jobs.begin(), _jobs.end(),
+                               [&](const Job& j) { return *j.request == msg->easy_handle; });
+        if (it == _jobs.end()) continue;
+        Job job = *it;
+        _jobs.erase(it);
+        job.request->JobDone(msg->data.result);
+        job.request->JobRemove(_multi);
+        // The handler may start new transfers, which is safe: the message
+        // queue of the multi handle survives additions.
+        if (job.handler) job.handler(job.request);
+    }
+}
+
+void EventLoop::RunDueTimers() {
+    int64_t now = NowMs();
+    std::vector<std::string> due;
+    for (const auto& t : _timers) {
+        if (t.second.dueMs <= now) due.push_back(t.first);
+    }
+    for (const std::string& name : due) {
+        auto it = _timers.find(name);
+        if (it == _timers.end() || it->second.dueMs > now) continue;
+        TimerHandler handler = std::move(it->second.handler);
+        _timers.erase(it);
+        if (handler) handler();
+    }
+}
+
+}  // namespace zeparelayd

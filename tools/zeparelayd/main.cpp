@@ -1,0 +1,135 @@
+// zeparelayd: the relay daemon.
+//
+// Exit statuses: 0 started (the parent reports the child's start-up word:
+// 0 started, 4 PID file not created, 255 no word) or stopped cleanly;
+// 1 a daemon already runs on the PID file; 2 bad usage; 3 the event loop
+// could not be set up.
+#define ZEPA_LOG_SOURCE "zeparelayd"
+
+#include <curl/curl.h>
+#include <libdaemon/dpid.h>
+#include <libdaemon/dsignal.h>
+#include <limits.h>
+#include <stdlib.h>
+
+#include <cstdio>
+#include <cstring>
+#include <string>
+
+#include <zeparelayd/config.h>
+#include <zeparelayd/daemon.h>
+#include <zeparelayd/request.h>
+#include <zepasdk/sysroot.h>
+
+#include "common/log.h"
+#include "common/paths.h"
+#include "event_loop.h"
+#include "relay_daemon.h"
+
+using namespace ZEPA::Relay;
+
+namespace {
+
+const char kUsage[] =
+    "Usage: zeparelayd [OPTIONS]\n"
+    "Relay daemon: registers the appliance's services with the relay's control\n"
+    "server and keeps its alias registered.\n"
+    "\n"
+    "  --root DIR       system root: every fixed path is taken below DIR\n"
+    "  --ca-file FILE   also trust this CA for https (staging set-ups only)\n"
+    "  -f, --foreground do not daemonise; log to standard error\n"
+    "  -h, --help       this text\n"
+    "  -V, --version    print the version\n"
+    "\n"
+    "Signals: TERM/INT/QUIT stop, HUP reloads the configuration, USR1 writes the\n"
+    "debug dump, RTMIN+1 updates the alias now.\n"
+    "Exit status: 0 started, 1 already running, 2 bad usage, 3 no event loop,\n"
+    "4 PID file not created, 255 the daemon gave no start-up word.\n";
+
+struct Options {
+    std::string root;
+    std::string caFile;
+    bool foreground = false;
+};
+
+// 0 parsed, 1 done (help/version printed), 2 bad usage.
+int ParseOptions(int argc, char** argv, Options& opt) {
+    for (int i = 1; i < argc; ++i) {
+        const std::string arg = argv[i];
+        if (arg == "-h" || arg == "--help") {
+            fputs(kUsage, stdout);
+            return 1;
+        }
+        if (arg == "-V" || arg == "--version") {
+            printf("zeparelayd %s\n", ZEPARELAYD_VERSION);
+            return 1;
+        }
+        if (arg == "-f" || arg == "--foreground") {
+            opt.foreground = true;
+        } else if ((arg == "--root" || arg == "--ca-file") && i + 1 < argc) {
+            (arg == "--root" ? opt.root : opt.caFile) = argv[++i];
+        } else {
+            fprintf(stderr, "zeparelayd: unknown or incomplete option '%s'\n%s", arg.c_str(), kUsage);
+            return 2;
+        }
+    }
+    return 0;
+}
+
+// libdaemon changes to "/" when it forks: relative names must be made absolute first.
+bool Absolute(std::string& path) {
+    if (path.empty()) return true;
+    char buf[PATH_MAX];
+    if (realpath(path.c_str(), buf) == nullptr) return false;
+    path = buf;
+    return true;
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+    Options opt;
+    const int parsed = ParseOptions(argc, argv, opt);
+    if (parsed != 0) return parsed == 1 ? 0 : 2;
+    if (!Absolute(opt.root) || !Absolute(opt.caFile)) {
+        fprintf(stderr, "zeparelayd: no such directory or file: %s\n", strerror(errno));
+        return 2;
+    }
+    if (!opt.root.empty() && ZEPASysRootSet(opt.root.c_str()) != 0) {
+        fprintf(stderr, "zeparelayd: bad root '%s'\n", opt.root.c_str());
+        return 2;
+    }
+    if (!opt.caFile.empty()) Request::SetExtraCaFile(opt.caFile);
+
+    Daemon::SetName(argv[0]);
+    const std::string confPath = Paths::Resolve(Paths::RELAYD_CONF);
+    {
+        // Log settings before forking, so that the child's standard error
+        // points at the configured file from its first line on.
+        RelaydConf early(confPath.c_str());
+        Daemon::SetLogFile(early.logFile.empty() ? std::string() : Paths::Resolve(early.logFile),
+                           early.logLevel);
+    }
+    if (!Daemon::Init(!opt.foreground)) return 1;
+
+    curl_global_init(CURL_GLOBAL_DEFAULT);
+    int status = 0;
+    {
+        zeparelayd::EventLoop loop;
+        zeparelayd::RelayDaemon relay(confPath, loop);
+        relay.ApplyLogSettings();
+        if (!loop.IsReady() || Daemon::InitSignalHandler() < 0) {
+            ZLOG(ZEPA_LOG_ERR, "cannot set up the event loop");
+            status = 3;
+        } else {
+            loop.OnSignal([&relay](int sig) { relay.HandleSignal(sig); });
+            relay.Start();
+            if (!loop.Run()) status = 3;
+            relay.Shutdown();
+            daemon_signal_done();
+        }
+    }
+    daemon_pid_file_remove();
+    curl_global_cleanup();
+    return status;
+}

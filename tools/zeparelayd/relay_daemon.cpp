@@ -1,0 +1,105 @@
+#define ZEPA_LOG_SOURCE "zeparelayd"
+
+#include "relay_daemon.h"
+
+#include <signal.h>
+#include <sys/wait.h>
+
+#include "common/log.h"
+#include "common/paths.h"
+
+using namespace ZEPA::Relay;
+
+namespace zeparelayd {
+
+RelayDaemon::RelayDaemon(const std::string& confPath, EventLoop& loop)
+    : _confPath(confPath),
+      _loop(loop),
+      _conf(new RelaydConf(confPath.c_str())),
+      _state(RELAYD_STATE_STARTING),
+      _error(RELAYD_SUCCESS),
+      _regFailures(0),
+      _regHalted(false),
+      _aliasFailures(0),
+      _aliasHalted(false),
+      _aliasMapped(false),
+      _aliasRetryClass(-1) {}
+
+void RelayDaemon::ApplyLogSettings() {
+    // The configuration names appliance paths; under a staging root they live below it.
+    const std::string file = _conf->logFile.empty() ? std::string() : Paths::Resolve(_conf->logFile);
+    Daemon::SetLogFile(file, _conf->logLevel);
+    ZLOG(ZEPA_LOG_DEBUG, "log level %d, log file [%s]", _conf->logLevel, file.c_str());
+}
+
+void RelayDaemon::Start() {
+    ZLOG(ZEPA_LOG_NOTICE, "started, pid %d, relay %s", static_cast<int>(getpid()),
+         _conf->enable ? "enabled" : "disabled");
+    SetState(RELAYD_STATE_STARTING, RELAYD_SUCCESS);
+    StartRegistration();
+}
+
+void RelayDaemon::HandleSignal(int sig) {
+    if (sig == SIGRTMIN + 1) {
+        ZLOG(ZEPA_LOG_INFO, "alias update requested");
+        ScheduleAlias(ALIAS_REQ_MAP, 0, "requested");
+        return;
+    }
+    switch (sig) {
+        case SIGTERM:
+        case SIGINT:
+        case SIGQUIT:
+            ZLOG(ZEPA_LOG_NOTICE, "signal %d: stopping", sig);
+            _loop.Stop();
+            break;
+        case SIGHUP:
+            Reload();
+            break;
+        case SIGUSR1:
+            WriteDebugDump();
+            break;
+        case SIGCHLD:
+            ReapChildren();
+            break;
+        default:
+            // SIGPIPE, SIGALRM, SIGUSR2, SIGRTMIN+5: their handlers only have to
+            // exist (the tunnel's wait relies on them); nothing to do here.
+            ZLOG(ZEPA_LOG_DEBUG, "signal %d ignored", sig);
+            break;
+    }
+}
+
+void RelayDaemon::Reload() {
+    ZLOG(ZEPA_LOG_NOTICE, "reloading configuration");
+    if (!_conf->Reload()) {
+        // The old configuration stays in force; the library said why.
+        return;
+    }
+    ApplyLogSettings();
+    _loop.CancelRequests("register");
+    _loop.CancelTimer("register");
+    StopAliasCycle();
+    _regFailures = 0;
+    _regHalted = false;
+    _aliasFailures = 0;
+    _aliasHalted = false;
+    _aliasMapped = false;
+    StartRegistration();
+}
+
+void RelayDaemon::ReapChildren() {
+    int status = 0;
+    pid_t pid;
+    while ((pid = waitpid(-1, &status, WNOHANG)) > 0) {
+        ZLOG(ZEPA_LOG_DEBUG, "child %d ended (0x%x)", static_cast<int>(pid), status);
+    }
+}
+
+void RelayDaemon::Shutdown() {
+    _loop.CancelRequests("register");
+    StopAliasCycle();
+    SetState(RELAYD_STATE_STOPED, _error);
+    ZLOG(ZEPA_LOG_NOTICE, "stopped");
+}
+
+}  // namespace zeparelayd

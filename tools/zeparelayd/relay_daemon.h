@@ -1,0 +1,97 @@
+// The relay daemon proper: configuration, registration with the control
+// server, the alias cycle and the files it publishes, all driven by one
+// EventLoop.
+#ifndef ZEPARELAYD_TOOL_RELAY_DAEMON_H
+#define ZEPARELAYD_TOOL_RELAY_DAEMON_H
+
+#include <json/value.h>
+
+#include <boost/shared_ptr.hpp>
+#include <cstdint>
+#include <memory>
+#include <string>
+
+#include <zeparelayd/config.h>
+#include <zeparelayd/errors.h>
+#include <zeparelayd/request.h>
+#include <zeparelayd/request_alias.h>
+
+#include "event_loop.h"
+
+namespace zeparelayd {
+
+// State words as the status readers show them:
+//   2 "starting"   configuration loaded, nothing sent yet
+//   3 "login"      registering with the control server, or waiting to retry
+//                  ("error" tells why the last attempt failed)
+//   5 "connected"  registered: the control server knows the services and
+//                  gave the server id
+//   7 "logout"     the relay is switched off ("runrelayd" is not "yes"); the
+//                  daemon idles until the next reload
+//   8 "stoped"     the daemon has stopped (written last, on the way out)
+// 4 "direct_connect" and 6 (the tunnel's "connected") are not used by this
+// daemon: it never opens a tunnel.
+class RelayDaemon {
+public:
+    RelayDaemon(const std::string& confPath, EventLoop& loop);
+
+    // Log settings of the configuration; called at start and on every reload.
+    void ApplyLogSettings();
+    // Status file with state "starting", then the first registration.
+    void Start();
+    // What each signal asks of the daemon; stop signals end the loop.
+    void HandleSignal(int sig);
+    // Final status ("stoped"); the caller removes the PID file.
+    void Shutdown();
+
+    ZEPA::Relay::RelaydConf& Conf() { return *_conf; }
+
+private:
+    // ---- registration (registration.cpp) -------------------------------------
+    void StartRegistration();
+    void OnRegistrationDone(boost::shared_ptr<ZEPA::Relay::Request> req);
+    Json::Value RegistrationBody();
+    bool StoreServerId(const std::string& id);
+    void ScheduleRegistrationRetry();
+
+    // ---- alias cycle (alias_cycle.cpp) ---------------------------------------
+    void ScheduleAlias(ZEPA::Relay::ALIAS_REQUEST_CMD cmd, int64_t delayMs, const char* why);
+    void RunAlias(ZEPA::Relay::ALIAS_REQUEST_CMD cmd);
+    void OnAliasDone(ZEPA::Relay::ALIAS_REQUEST_CMD cmd, boost::shared_ptr<ZEPA::Relay::Request> req);
+    void RecordAliasStatus(const std::string& word, const std::string& extra);
+    void StopAliasCycle();
+
+    // ---- published files (status_writer.cpp) ---------------------------------
+    void SetState(ZEPA::Relay::RELAYD_STATE state, ZEPA::Relay::RELAYD_RET error);
+    void WriteStatus();
+    void WriteDebugDump();
+    Json::Value DebugDump() const;
+
+    // ---- signals (relay_daemon.cpp) -----------------------------------------
+    void Reload();
+    void ReapChildren();
+
+    std::string _confPath;
+    EventLoop& _loop;
+    std::unique_ptr<ZEPA::Relay::RelaydConf> _conf;
+    ZEPA::Relay::RELAYD_STATE _state;
+    ZEPA::Relay::RELAYD_RET _error;
+    Json::Value _lastStatus;
+
+    // Registration bookkeeping.
+    int _regFailures;
+    bool _regHalted;  // a failure that only a reload can cure
+
+    // Alias bookkeeping.
+    int _aliasFailures;
+    bool _aliasHalted;  // stop-class answer: automatic retries wait for a reload
+    bool _aliasMapped;  // the alias was mapped since the last (re)registration
+    std::string _aliasWord;
+    std::string _aliasExtra;
+    int _aliasRetryClass;
+    std::string _aliasNextCmd;
+};
+
+}  // namespace zeparelayd
+
+#endif
