@@ -103,6 +103,7 @@ int EventLoop::PollTimeout() const {
 bool EventLoop::Run() {
     _running = true;
     while (_running) {
+        if (_onIdle) _onIdle();
         std::vector<pollfd> fds;
         fds.push_back(pollfd{daemon_signal_fd(), POLLIN, 0});
         for (const auto& s : _sockets) {

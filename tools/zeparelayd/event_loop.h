@@ -34,6 +34,8 @@ public:
     bool IsReady() const { return _multi != nullptr; }
 
     void OnSignal(SignalHandler handler) { _onSignal = std::move(handler); }
+    // Runs after every round of events, before the loop waits again.
+    void OnIdle(TimerHandler handler) { _onIdle = std::move(handler); }
 
     // One-shot timers by name; setting a name again replaces its deadline.
     void SetTimer(const std::string& name, int64_t delayMs, TimerHandler handler);
@@ -82,6 +84,7 @@ private:
     std::map<std::string, Timer> _timers;
     std::list<Job> _jobs;
     SignalHandler _onSignal;
+    TimerHandler _onIdle;
     bool _running;
 };
 

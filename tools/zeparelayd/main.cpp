@@ -123,8 +123,8 @@ int main(int argc, char** argv) {
             status = 3;
         } else {
             loop.OnSignal([&relay](int sig) { relay.HandleSignal(sig); });
-            relay.Start();
-            if (!loop.Run()) status = 3;
+            loop.OnIdle([&relay] { relay.Idle(); });
+            if (!relay.Start() || !loop.Run()) status = 3;
             relay.Shutdown();
             daemon_signal_done();
         }

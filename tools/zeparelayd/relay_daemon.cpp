@@ -4,9 +4,13 @@
 
 #include <signal.h>
 #include <sys/wait.h>
+#include <unistd.h>
+
+#include <cstdio>
 
 #include "common/log.h"
 #include "common/paths.h"
+#include "debug_dump.h"
 
 using namespace ZEPA::Relay;
 
@@ -32,11 +36,19 @@ void RelayDaemon::ApplyLogSettings() {
     ZLOG(ZEPA_LOG_DEBUG, "log level %d, log file [%s]", _conf->logLevel, file.c_str());
 }
 
-void RelayDaemon::Start() {
+bool RelayDaemon::Start() {
+    char name[1024];
+    snprintf(name, sizeof(name), Paths::DEBUG_FILE_FORMAT, static_cast<int>(getpid()));
+    if (!InstallDebugDump(Paths::Resolve(name))) {
+        ZLOG(ZEPA_LOG_ERR, "cannot handle SIGUSR1");
+        return false;
+    }
+    RenderDebugDump();
     ZLOG(ZEPA_LOG_NOTICE, "started, pid %d, relay %s", static_cast<int>(getpid()),
          _conf->enable ? "enabled" : "disabled");
     SetState(RELAYD_STATE_STARTING, RELAYD_SUCCESS);
     StartRegistration();
+    return true;
 }
 
 void RelayDaemon::HandleSignal(int sig) {
@@ -55,13 +67,11 @@ void RelayDaemon::HandleSignal(int sig) {
         case SIGHUP:
             Reload();
             break;
-        case SIGUSR1:
-            WriteDebugDump();
-            break;
         case SIGCHLD:
             ReapChildren();
             break;
         default:
+            // SIGUSR1 never comes this way (debug_dump.h).
             // SIGPIPE, SIGALRM, SIGUSR2, SIGRTMIN+5: their handlers only have to
             // exist (the tunnel's wait relies on them); nothing to do here.
             ZLOG(ZEPA_LOG_DEBUG, "signal %d ignored", sig);
@@ -98,6 +108,7 @@ void RelayDaemon::ReapChildren() {
 void RelayDaemon::Shutdown() {
     _loop.CancelRequests("register");
     StopAliasCycle();
+    RemoveDebugDump();
     SetState(RELAYD_STATE_STOPED, _error);
     ZLOG(ZEPA_LOG_NOTICE, "stopped");
 }

@@ -37,14 +37,15 @@ public:
 
     // Log settings of the configuration; called at start and on every reload.
     void ApplyLogSettings();
-    // Status file with state "starting", then the first registration.
-    void Start();
+    // Status file with state "starting", the debug dump handler, then the
+    // first registration.
+    bool Start();
     // What each signal asks of the daemon; stop signals end the loop.
     void HandleSignal(int sig);
+    // After every round of events: refresh what SIGUSR1 will write.
+    void Idle() { RenderDebugDump(); }
     // Final status ("stoped"); the caller removes the PID file.
     void Shutdown();
-
-    ZEPA::Relay::RelaydConf& Conf() { return *_conf; }
 
 private:
     // ---- registration (registration.cpp) -------------------------------------
@@ -64,7 +65,7 @@ private:
     // ---- published files (status_writer.cpp) ---------------------------------
     void SetState(ZEPA::Relay::RELAYD_STATE state, ZEPA::Relay::RELAYD_RET error);
     void WriteStatus();
-    void WriteDebugDump();
+    void RenderDebugDump();
     Json::Value DebugDump() const;
 
     // ---- signals (relay_daemon.cpp) -----------------------------------------

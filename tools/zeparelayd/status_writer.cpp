@@ -1,11 +1,12 @@
 // The files the daemon publishes for other processes: the status file,
-// rewritten on every change, and the debug dump, written on SIGUSR1 within
-// the few milliseconds the querying side waits.
+// rewritten on every change, and the debug dump, rendered after every event
+// and written by the SIGUSR1 handler (debug_dump.h).
 #define ZEPA_LOG_SOURCE "status_writer"
 
 #include <unistd.h>
 
 #include <cstdio>
+#include <ctime>
 #include <sstream>
 
 #include <json/reader.h>
@@ -15,6 +16,7 @@
 
 #include "common/log.h"
 #include "common/paths.h"
+#include "debug_dump.h"
 #include "relay_daemon.h"
 
 using namespace ZEPA::Relay;
@@ -93,6 +95,8 @@ void RelayDaemon::WriteStatus() {
 Json::Value RelayDaemon::DebugDump() const {
     Json::Value dump(Json::objectValue);
     dump["pid"] = static_cast<int>(getpid());
+    // Rendered after each event, not at the moment of the query.
+    dump["rendered_at"] = static_cast<Json::Int64>(time(nullptr));
     dump["state"] = GetStateStr(_state);
     dump["error"] = GetErrorStr(_error);
     dump["log_level"] = Daemon::_logLevel;
@@ -123,18 +127,16 @@ Json::Value RelayDaemon::DebugDump() const {
         job.request->Write(one);
         one["data"] = MaskBody(one["data"].asString());
         one["tag"] = job.tag;
-        one["age_ms"] = static_cast<Json::Int64>(now - job.startedMs);
+        one["running_ms"] = static_cast<Json::Int64>(now - job.startedMs);
         requests.append(one);
     }
     return dump;
 }
 
-void RelayDaemon::WriteDebugDump() {
-    char name[1024];
-    snprintf(name, sizeof(name), Paths::DEBUG_FILE_FORMAT, static_cast<int>(getpid()));
-    if (!RelaydConf::WriteJsonFile(Paths::Resolve(name), DebugDump())) {
-        ZLOG(ZEPA_LOG_ERR, "debug dump [%s] not written", name);
-    }
+void RelayDaemon::RenderDebugDump() {
+    Json::StreamWriterBuilder writer;
+    writer["indentation"] = "   ";
+    PublishDebugDump(Json::writeString(writer, DebugDump()) + "\n");
 }
 
 }  // namespace zeparelayd

@@ -1,0 +1,142 @@
+#!/usr/bin/env bash
+# The relay daemon end to end, on this machine, without touching the system:
+# builds the project, stages a sample appliance in a private folder, starts a
+# local relay/alias server on loopback (HTTPS with a throwaway CA), runs
+# zeparelayd against it and drives it with zeparelayctl.
+#
+#   ./scripts/demo.sh            (as root on a fresh machine: installs packages first)
+#
+# Everything it starts is stopped again on exit, also on Ctrl-C.
+set -euo pipefail
+
+src=$(cd "$(dirname "$0")/.." && pwd)
+build=${ZEPA_DEMO_BUILD:-$src/build-demo}
+stage=$build/demo-root
+bin_d=$build/tools/zeparelayd/zeparelayd
+bin_c=$build/tools/zeparelayctl/zeparelayctl
+server_pid=""
+
+step() { printf '\n\033[1m==> %s\033[0m\n' "$*"; }
+say() { printf '    %s\n' "$*"; }
+ctl() { "$bin_c" --root "$stage" "$@"; }
+
+cleanup() {
+  local rc=$?
+  trap - EXIT INT TERM
+  if [ -f "$stage/var/run/zeparelayd.pid" ]; then
+    local pid
+    pid=$(cat "$stage/var/run/zeparelayd.pid" 2>/dev/null || true)
+    if [ -n "$pid" ] && kill -0 "$pid" 2>/dev/null; then
+      kill -TERM "$pid" 2>/dev/null || true
+      for _ in $(seq 50); do kill -0 "$pid" 2>/dev/null || break; sleep 0.1; done
+      kill -KILL "$pid" 2>/dev/null || true
+    fi
+  fi
+  if [ -n "$server_pid" ] && kill -0 "$server_pid" 2>/dev/null; then
+    kill -TERM "$server_pid" 2>/dev/null || true
+    wait "$server_pid" 2>/dev/null || true
+  fi
+  exit "$rc"
+}
+trap cleanup EXIT
+trap 'echo; echo "interrupted"; exit 130' INT TERM
+
+# Polls a command until its output contains a text (bounded wait).
+wait_for() { # seconds text command...
+  local seconds=$1 text=$2
+  shift 2
+  for _ in $(seq $((seconds * 10))); do
+    if "$@" 2>/dev/null | grep -q -- "$text"; then return 0; fi
+    sleep 0.1
+  done
+  echo "demo: gave up waiting for '$text' from: $*" >&2
+  return 1
+}
+
+alias_requests() {
+  python3 -c 'import json,sys,urllib.request as u; print(len(json.load(u.urlopen(
+    "http://127.0.0.1:%s/_control/requests?path=/alias_update.php" % sys.argv[1]))["requests"]))' "$http_port"
+}
+
+step "1. Dependencies (Debian packages)"
+"$src/scripts/install-deps.sh"
+
+step "2. Build (library, daemon, control tool) in $build"
+cmake -S "$src" -B "$build" -G Ninja -DCMAKE_BUILD_TYPE=RelWithDebInfo \
+  -DZEPA_BUILD_TESTS=OFF -DZEPA_BUILD_BENCH=OFF >/dev/null
+ninja -C "$build" zeparelayd_daemon zeparelayctl
+
+step "3. A sample appliance in a staging root"
+rm -rf "$stage"
+"$src/scripts/stage_appliance.sh" "$stage"
+say "system files:      $stage/etc/zepainfo.conf (runrelayd=yes), firewall definitions, router rules"
+say "every fixed path of the daemon (config, PID, log, status) lives below this root"
+
+step "4. Local relay control and alias server (HTTPS on loopback, throwaway CA)"
+python3 "$src/tools/localserver/zepa_localserver.py" --ready-file "$stage/tmp/server.json" \
+  --cert-dir "$stage/certs" &
+server_pid=$!
+for _ in $(seq 100); do [ -f "$stage/tmp/server.json" ] && break; sleep 0.1; done
+[ -f "$stage/tmp/server.json" ] || { echo "demo: the local server did not start" >&2; exit 1; }
+read -r http_port https_port ca_file < <(python3 -c \
+  'import json,sys; d=json.load(open(sys.argv[1])); print(d["http_port"], d["https_port"], d["ca_file"])' \
+  "$stage/tmp/server.json")
+say "control server https://127.0.0.1:$https_port/Serv.php, alias server https://127.0.0.1:$https_port"
+say "its CA ($ca_file) is trusted by the daemon through --ca-file (staging only)"
+
+step "5. The relay configuration points at the local server"
+cat >"$stage/usr/zepa/etc/zeparelayd/zeparelayd.conf" <<CONF
+{
+   "server_control" : { "protocol" : "https", "host" : "127.0.0.1", "port" : $https_port },
+   "server_alias" : { "alias" : "demo-box", "url" : "https://127.0.0.1:$https_port" },
+   "service" : [],
+   "log_level" : 6,
+   "log_file" : "/var/log/zeparelayd.log"
+}
+CONF
+say "$(tr -s ' \n' ' ' <"$stage/usr/zepa/etc/zeparelayd/zeparelayd.conf")"
+
+step "6. Start the daemon (it forks; the exit status is the child's start-up word)"
+set +e
+"$bin_d" --root "$stage" --ca-file "$ca_file"
+rc=$?
+set -e
+say "zeparelayd exited with $rc (0 = the daemon is up), PID $(cat "$stage/var/run/zeparelayd.pid")"
+[ "$rc" -eq 0 ] || exit 1
+say "a second start is refused while it runs:"
+set +e
+"$bin_d" --root "$stage" --ca-file "$ca_file" 2>&1 | sed 's/^/      /'
+say "exit status ${PIPESTATUS[0]}"
+set -e
+
+step "7. It registers with the control server and maps its alias"
+wait_for 20 "alias_status: good" ctl status
+ctl status | sed 's/^/      /'
+say "server id stored in the configuration: $(ctl server-id)"
+
+step "8. Ask for an alias update now (SIGRTMIN+1)"
+before=$(alias_requests)
+ctl update-alias | sed 's/^/      /'
+for _ in $(seq 100); do [ "$(alias_requests)" -gt "$before" ] && break; sleep 0.1; done
+say "alias requests seen by the server: $before before, $(alias_requests) after"
+
+step "9. The debug dump (SIGUSR1; written within milliseconds)"
+ctl status --debug | python3 -m json.tool | sed 's/^/      /'
+
+step "10. Switch the relay off, then on again"
+ctl disable | sed 's/^/      /'
+wait_for 10 "state: logout" ctl status
+ctl status | sed 's/^/      /'
+ctl enable | sed 's/^/      /'
+wait_for 20 "state: connected" ctl status
+ctl status | sed 's/^/      /'
+
+step "11. Stop the daemon"
+ctl stop | sed 's/^/      /'
+set +e
+ctl status | sed 's/^/      /'
+set -e
+say "log file: $stage/var/log/zeparelayd.log (last lines)"
+tail -n 5 "$stage/var/log/zeparelayd.log" | sed 's/^/      /'
+
+step "Done: everything started by the demo is stopped again"

@@ -1,0 +1,334 @@
+// The real daemon in a staging root against the local relay/alias server:
+// start-up, states, signals, reload, alias cycle, server id notice, stop.
+#include <curl/curl.h>
+#include <fcntl.h>
+#include <signal.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <chrono>
+#include <cstdlib>
+#include <fstream>
+#include <functional>
+#include <sstream>
+#include <thread>
+
+#include <zeparelayd/daemon.h>
+
+#include "support/local_server.h"
+#include "support/test_support.h"
+
+using namespace ZEPA::Relay;
+
+namespace {
+
+const std::string kDaemon = ZEPA_BINARY_DIR "/tools/zeparelayd/zeparelayd";
+const std::string kCtl = ZEPA_BINARY_DIR "/tools/zeparelayctl/zeparelayctl";
+const std::string kStage = ZEPA_SOURCE_DIR "/scripts/stage_appliance.sh";
+
+// Runs a program, waits for it and gives its exit status (-1 when it did not
+// exit normally); its standard output goes to out.
+int RunProgram(const std::vector<std::string>& args, std::string* out = nullptr) {
+    char tmpl[] = "/tmp/zepa_it_outXXXXXX";
+    int fd = mkstemp(tmpl);
+    pid_t pid = fork();
+    if (pid == 0) {
+        dup2(fd, 1);
+        std::vector<char*> argv;
+        for (const std::string& a : args) argv.push_back(const_cast<char*>(a.c_str()));
+        argv.push_back(nullptr);
+        execv(argv[0], argv.data());
+        _exit(127);
+    }
+    int status = 0;
+    waitpid(pid, &status, 0);
+    close(fd);
+    if (out != nullptr) *out = zepatest::ReadFile(tmpl);
+    unlink(tmpl);
+    return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+}
+
+size_t Append(char* data, size_t size, size_t count, void* out) {
+    static_cast<std::string*>(out)->append(data, size * count);
+    return size * count;
+}
+
+// A plain HTTP call to the local server's own admin routes.
+std::string Http(const std::string& method, const std::string& url, const std::string& body = "") {
+    std::string answer;
+    CURL* curl = curl_easy_init();
+    curl_easy_setopt(curl, CURLOPT_URL, url.c_str());
+    curl_easy_setopt(curl, CURLOPT_CUSTOMREQUEST, method.c_str());
+    if (method == "POST") curl_easy_setopt(curl, CURLOPT_POSTFIELDS, body.c_str());
+    curl_easy_setopt(curl, CURLOPT_WRITEFUNCTION, Append);
+    curl_easy_setopt(curl, CURLOPT_WRITEDATA, &answer);
+    curl_easy_setopt(curl, CURLOPT_TIMEOUT, 10L);
+    curl_easy_perform(curl);
+    curl_easy_cleanup(curl);
+    return answer;
+}
+
+bool WaitUntil(const std::function<bool()>& cond, int ms = 15000) {
+    const auto end = std::chrono::steady_clock::now() + std::chrono::milliseconds(ms);
+    while (std::chrono::steady_clock::now() < end) {
+        if (cond()) return true;
+        std::this_thread::sleep_for(std::chrono::milliseconds(20));
+    }
+    return cond();
+}
+
+// A process that is gone or a zombie no longer runs.
+bool Alive(pid_t pid) {
+    if (pid <= 0 || kill(pid, 0) != 0) return false;
+    std::ifstream stat("/proc/" + std::to_string(pid) + "/stat");
+    std::string text((std::istreambuf_iterator<char>(stat)), std::istreambuf_iterator<char>());
+    size_t close = text.rfind(')');
+    return close == std::string::npos || text.size() < close + 3 || text[close + 2] != 'Z';
+}
+
+class DaemonProcess : public zepatest::RootTest {
+protected:
+    void SetUp() override {
+        RootTest::SetUp();
+        ASSERT_TRUE(server.ok()) << server.error();
+        ASSERT_EQ(0, RunProgram({"/bin/bash", kStage, root.dir()}));
+        WriteConfig(4);
+    }
+
+    void TearDown() override {
+        pid_t pid = DaemonPid();
+        if (Alive(pid)) {
+            kill(pid, SIGTERM);
+            if (!WaitUntil([&] { return !Alive(pid); }, 5000)) kill(pid, SIGKILL);
+        }
+        RootTest::TearDown();
+    }
+
+    void WriteConfig(int logLevel) {
+        std::ostringstream conf;
+        conf << "{\n"
+             << "  \"server_control\": {\"protocol\": \"https\", \"host\": \"127.0.0.1\", \"port\": "
+             << server.httpsPort() << "},\n"
+             << "  \"server_alias\": {\"alias\": \"it-box\", \"url\": \"" << server.httpsUrl() << "\"},\n"
+             << "  \"log_level\": " << logLevel << ",\n"
+             << "  \"log_file\": \"/var/log/zeparelayd.log\"\n"
+             << "}\n";
+        root.write("/usr/zepa/etc/zeparelayd/zeparelayd.conf", conf.str());
+    }
+
+    int StartDaemon() { return RunProgram({kDaemon, "--root", root.dir(), "--ca-file", server.caFile()}); }
+
+    int Ctl(const std::vector<std::string>& args, std::string* out = nullptr) {
+        std::vector<std::string> all = {kCtl, "--root", root.dir()};
+        all.insert(all.end(), args.begin(), args.end());
+        return RunProgram(all, out);
+    }
+
+    std::string CtlStatus() {
+        std::string out;
+        Ctl({"status"}, &out);
+        return out;
+    }
+
+    bool StatusHas(const std::string& text, int ms = 15000) {
+        return WaitUntil([&] { return CtlStatus().find(text) != std::string::npos; }, ms);
+    }
+
+    pid_t DaemonPid() {
+        if (!root.exists("/var/run/zeparelayd.pid")) return -1;
+        return atoi(root.read("/var/run/zeparelayd.pid").c_str());
+    }
+
+    Json::Value StatusFile() { return zepatest::ParseJson(root.read("/tmp/.zeparelayd.status")); }
+
+    // 11 means the machine did not let the daemon run within the reader's few
+    // milliseconds; asking again is what any caller does.
+    Json::Value Dump() {
+        Json::Value dump;
+        int ret = Daemon::DebugStatus(dump);
+        for (int i = 0; ret == 11 && i < 20; ++i) ret = Daemon::DebugStatus(dump);
+        EXPECT_EQ(0, ret);
+        return dump;
+    }
+
+    int Requests(const std::string& path) { return static_cast<int>(server.requests(path).size()); }
+
+    int Notices() {
+        if (!root.exists("/var/log/zepanosnotify.log")) return 0;
+        std::string text = root.read("/var/log/zepanosnotify.log");
+        return static_cast<int>(std::count(text.begin(), text.end(), '\n'));
+    }
+
+    zepatest::LocalServer server;
+};
+
+TEST_F(DaemonProcess, StartsRegistersAndMapsItsAlias) {
+    ASSERT_EQ(0, StartDaemon());
+    pid_t pid = DaemonPid();
+    ASSERT_TRUE(Alive(pid));
+    ASSERT_TRUE(StatusHas("alias_status: good"));
+    const std::string status = CtlStatus();
+    EXPECT_NE(std::string::npos, status.find("state: connected")) << status;
+    EXPECT_NE(std::string::npos, status.find("alias: it-box")) << status;
+    EXPECT_EQ(0, Ctl({"status"}));
+    Json::Value file = StatusFile();
+    EXPECT_EQ(pid, file["pid"].asInt());
+    EXPECT_EQ(5, file["state"].asInt());
+    EXPECT_EQ(0, file["error"].asInt());
+    EXPECT_FALSE(file["serverID"].asString().empty());
+    // The registration carried the identity and the services.
+    Json::Value regs = server.requests("/Serv.php");
+    ASSERT_GE(regs.size(), 1u);
+    Json::Value body = zepatest::ParseJson(zepatest::RecordedBody(regs[0]));
+    EXPECT_EQ("register", body["command"].asString());
+    EXPECT_TRUE(body["services"].isArray());
+}
+
+TEST_F(DaemonProcess, SecondStartIsRefused) {
+    ASSERT_EQ(0, StartDaemon());
+    pid_t pid = DaemonPid();
+    EXPECT_EQ(1, StartDaemon());
+    EXPECT_TRUE(Alive(pid));
+    EXPECT_EQ(pid, DaemonPid());
+}
+
+TEST_F(DaemonProcess, StateWordsFollowWhatTheDaemonDoes) {
+    // A refused registration keeps the daemon logging in, with the reason.
+    Json::Value spec;
+    spec["path"] = "/Serv.php";
+    spec["json"]["errno"] = 2;
+    spec["count"] = 1;
+    ASSERT_TRUE(server.scriptRaw(spec));
+    ASSERT_EQ(0, StartDaemon());
+    ASSERT_TRUE(StatusHas("error: err_auth"));
+    EXPECT_NE(std::string::npos, CtlStatus().find("state: login"));
+
+    EXPECT_EQ(0, Ctl({"reload"}));
+    ASSERT_TRUE(StatusHas("state: connected"));
+
+    EXPECT_EQ(0, Ctl({"disable"}));
+    ASSERT_TRUE(StatusHas("state: logout"));
+    EXPECT_EQ(0, Ctl({"enable"}));
+    ASSERT_TRUE(StatusHas("state: connected"));
+
+    EXPECT_EQ(0, Ctl({"stop"}));
+    EXPECT_NE(std::string::npos, CtlStatus().find("state: not_running"));
+    EXPECT_EQ(1, Ctl({"status"}));
+}
+
+TEST_F(DaemonProcess, DebugDumpAnswersWhileARequestHangs) {
+    ASSERT_TRUE(server.hang("/Serv.php", 30));
+    ASSERT_EQ(0, StartDaemon());
+    ASSERT_TRUE(StatusHas("state: login"));
+    ASSERT_TRUE(WaitUntil([&] { return Requests("/Serv.php") == 1; }));
+    Daemon::LibInit();
+    // A query that finds the machine too busy to let the daemon run within
+    // the reader's few milliseconds answers 11; it may be asked again, but a
+    // daemon that does not answer while its request hangs fails every time.
+    int retries = 0;
+    for (int i = 0; i < 200; ++i) {
+        Json::Value dump;
+        int ret = Daemon::DebugStatus(dump);
+        for (int again = 0; ret == 11 && again < 20; ++again, ++retries) ret = Daemon::DebugStatus(dump);
+        ASSERT_EQ(0, ret) << "query " << i;
+        ASSERT_EQ(1u, dump["requests"].size()) << "query " << i;
+        EXPECT_EQ("register", dump["requests"][0]["tag"].asString());
+        EXPECT_EQ("async", dump["requests"][0]["mode"].asString());
+    }
+    RecordProperty("busy_retries", retries);
+    // Credentials never show in the dump.
+    Json::Value sent = zepatest::ParseJson(zepatest::RecordedBody(server.requests("/Serv.php")[0]));
+    const std::string token = sent["identity"]["token"].asString();
+    ASSERT_FALSE(token.empty());
+    const std::string dumped = zepatest::ToJson(Dump());
+    EXPECT_EQ(std::string::npos, dumped.find(token));
+    EXPECT_NE(std::string::npos, dumped.find("***"));
+}
+
+TEST_F(DaemonProcess, ReloadAppliesANewLogLevel) {
+    ASSERT_EQ(0, StartDaemon());
+    ASSERT_TRUE(StatusHas("state: connected"));
+    EXPECT_EQ(4, Dump()["log_level"].asInt());
+    const std::string log = root.path("/var/log/zeparelayd.log");
+    EXPECT_FALSE(zepatest::LogContains(zepatest::ReadFile(log), "log level 7"));
+    WriteConfig(7);
+    EXPECT_EQ(0, Ctl({"reload"}));
+    ASSERT_TRUE(WaitUntil([&] { return zepatest::LogContains(zepatest::ReadFile(log), "log level 7"); }));
+    EXPECT_TRUE(WaitUntil([&] { return Dump()["log_level"].asInt() == 7; }));
+}
+
+TEST_F(DaemonProcess, UpdateAliasSendsANewAliasRequest) {
+    ASSERT_EQ(0, StartDaemon());
+    ASSERT_TRUE(StatusHas("alias_status: good"));
+    const int before = Requests("/alias_update.php");
+    EXPECT_EQ(0, Ctl({"update-alias"}));
+    ASSERT_TRUE(WaitUntil([&] { return Requests("/alias_update.php") == before + 1; }));
+    Json::Value last = server.requests("/alias_update.php")[before];
+    EXPECT_NE(std::string::npos, zepatest::RecordedBody(last).find("alias=it-box"));
+}
+
+TEST_F(DaemonProcess, StopClassAnswerHaltsAliasRetriesUntilReload) {
+    ASSERT_TRUE(server.script("/alias_update.php", 200, "badauth:token rejected\n"));
+    ASSERT_EQ(0, StartDaemon());
+    ASSERT_TRUE(StatusHas("alias_status: badauth"));
+    Json::Value alias = Dump()["alias"];
+    EXPECT_TRUE(alias["halted"].asBool());
+    EXPECT_EQ(3, alias["retry_class"].asInt());
+    EXPECT_EQ(-1, alias["next_in_ms"].asInt64());
+    EXPECT_EQ(1, Requests("/alias_update.php"));
+
+    EXPECT_EQ(0, Ctl({"reload"}));
+    ASSERT_TRUE(StatusHas("alias_status: good"));
+    EXPECT_EQ(2, Requests("/alias_update.php"));
+    EXPECT_FALSE(Dump()["alias"]["halted"].asBool());
+}
+
+TEST_F(DaemonProcess, ServerIdChangeSendsExactlyOneNotice) {
+    ASSERT_EQ(0, StartDaemon());
+    ASSERT_TRUE(StatusHas("state: connected"));
+    std::string first;
+    ASSERT_EQ(0, Ctl({"server-id"}, &first));
+    ASSERT_TRUE(WaitUntil([&] { return Notices() == 1; }));  // the first id is a change from none
+
+    Json::Value devices = zepatest::ParseJson(Http("GET", server.httpUrl("/relay/admin/devices")))["devices"];
+    ASSERT_EQ(1u, devices.size());
+    const std::string serial = devices.getMemberNames()[0];
+    Json::Value moved = zepatest::ParseJson(
+        Http("POST", server.httpUrl("/relay/admin/reassign"), "{\"serial\": \"" + serial + "\"}"));
+    ASSERT_TRUE(moved["ok"].asBool());
+
+    const int regs = Requests("/Serv.php");
+    EXPECT_EQ(0, Ctl({"reload"}));
+    std::string second;
+    ASSERT_TRUE(WaitUntil([&] {
+        Ctl({"server-id"}, &second);
+        return second != first;
+    }));
+    EXPECT_TRUE(WaitUntil([&] { return Notices() == 2; }));
+    EXPECT_EQ(0u, root.read("/var/log/zepanosnotify.log")
+                      .find("@administrators relayservice:relayservice_serverid_change_title "
+                            "relayservice:relayservice_serverid_change_msg\n"));
+
+    // The same id again changes nothing: no further notice.
+    EXPECT_EQ(0, Ctl({"reload"}));
+    ASSERT_TRUE(WaitUntil([&] { return Requests("/Serv.php") == regs + 2; }));
+    ASSERT_TRUE(StatusHas("state: connected"));
+    EXPECT_EQ(2, Notices());
+}
+
+TEST_F(DaemonProcess, StopsCleanly) {
+    ASSERT_EQ(0, StartDaemon());
+    ASSERT_TRUE(StatusHas("state: connected"));
+    pid_t pid = DaemonPid();
+    EXPECT_EQ(0, Ctl({"stop"}));
+    EXPECT_FALSE(Alive(pid));
+    EXPECT_FALSE(root.exists("/var/run/zeparelayd.pid"));
+    Json::Value file = StatusFile();
+    EXPECT_EQ(8, file["state"].asInt());
+    EXPECT_EQ(pid, file["pid"].asInt());
+    EXPECT_EQ(1, Ctl({"status"}));
+    EXPECT_EQ(1, Ctl({"stop"}));
+}
+
+}  // namespace

@@ -1,0 +1,75 @@
+#include "debug_dump.h"
+
+#include <fcntl.h>
+#include <signal.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <cerrno>
+#include <cstdio>
+#include <cstring>
+
+namespace zeparelayd {
+
+namespace {
+
+char gPath[1024];
+char gTmp[1100];
+// Swapped whole by the loop; the handler only ever reads the current one, and
+// the loop frees a text only after it has been swapped out.
+std::atomic<const std::string*> gText{nullptr};
+
+// Async-signal-safe only: open, write, fchmod, close, rename.
+void OnDumpSignal(int) {
+    const int savedErrno = errno;
+    const std::string* text = gText.load();
+    if (text != nullptr) {
+        const int fd = open(gTmp, O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644);
+        if (fd >= 0) {
+            const char* p = text->data();
+            size_t left = text->size();
+            bool ok = true;
+            while (left > 0) {
+                const ssize_t n = write(fd, p, left);
+                if (n < 0 && errno == EINTR) continue;
+                if (n <= 0) {
+                    ok = false;
+                    break;
+                }
+                p += n;
+                left -= static_cast<size_t>(n);
+            }
+            fchmod(fd, 0644);
+            close(fd);
+            if (!ok || rename(gTmp, gPath) != 0) unlink(gTmp);
+        }
+    }
+    errno = savedErrno;
+}
+
+}  // namespace
+
+bool InstallDebugDump(const std::string& path) {
+    if (path.size() + 1 > sizeof(gPath)) return false;
+    memcpy(gPath, path.c_str(), path.size() + 1);
+    snprintf(gTmp, sizeof(gTmp), "%s.tmp.%d", gPath, static_cast<int>(getpid()));
+    struct sigaction sa;
+    memset(&sa, 0, sizeof(sa));
+    sa.sa_handler = OnDumpSignal;
+    sigemptyset(&sa.sa_mask);
+    sa.sa_flags = SA_RESTART;
+    return sigaction(SIGUSR1, &sa, nullptr) == 0;
+}
+
+void PublishDebugDump(const std::string& text) {
+    const std::string* old = gText.exchange(new std::string(text));
+    delete old;
+}
+
+void RemoveDebugDump() {
+    signal(SIGUSR1, SIG_IGN);
+    delete gText.exchange(nullptr);
+}
+
+}  // namespace zeparelayd
