@@ -64,5 +64,14 @@ echo "$*" >>"$root/var/log/zepanosnotify.log"
 SH
 chmod 755 "$root/usr/zepa/bin/zepanosnotify"
 
-# @IDENTITY@
+# Device identity as the manufacturing step leaves it: serial and token, and
+# the API key of the cloud service registration.
+mkdir -p "$root/etc/zepa"
+cat >"$root/etc/zepa/hubtoken.conf" <<'CONF'
+serial="2150ZSN012345"
+token="5f0c2a9e8d7b41c3a6e0f9b2d4c8e1a7"
+CONF
+cat >"$root/etc/zepa/cloudservice.conf" <<'CONF'
+api_key="3b8f1e6c0a9d47e2b5c1f8a04d7e9b2c6a1f3e8d0b4c7a92e5f1d8b3c6a0e4f7"
+CONF
 echo "staged a sample appliance in $root"

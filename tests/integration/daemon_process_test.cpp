@@ -332,3 +332,54 @@ TEST_F(DaemonProcess, StopsCleanly) {
 }
 
 }  // namespace
+
+// The control tool without a daemon: usage, help on every level, exit statuses.
+class ControlTool : public zepatest::RootTest {
+protected:
+    int Ctl(const std::vector<std::string>& args, std::string* out = nullptr) {
+        std::vector<std::string> all = {kCtl, "--root", root.dir()};
+        all.insert(all.end(), args.begin(), args.end());
+        return RunProgram(all, out);
+    }
+};
+
+TEST_F(ControlTool, HelpOnEveryLevel) {
+    std::string out;
+    EXPECT_EQ(0, RunProgram({kCtl, "--help"}, &out));
+    EXPECT_NE(std::string::npos, out.find("update-alias"));
+    for (const char* cmd : {"status", "start-log", "stop-log", "server-id", "update-alias", "reload", "stop",
+                            "enable", "disable", "services", "config"}) {
+        EXPECT_EQ(0, Ctl({cmd, "--help"}, &out)) << cmd;
+        EXPECT_EQ(0u, out.find(std::string("Usage: zeparelayctl [--root DIR] ") + cmd)) << out;
+    }
+    EXPECT_EQ(0, RunProgram({kDaemon, "--help"}, &out));
+    EXPECT_NE(std::string::npos, out.find("--root DIR"));
+}
+
+TEST_F(ControlTool, BadUsageExits64) {
+    EXPECT_EQ(64, RunProgram({kCtl}));
+    EXPECT_EQ(64, Ctl({"frobnicate"}));
+    EXPECT_EQ(64, Ctl({"status", "--verbose"}));
+    EXPECT_EQ(64, Ctl({"start-log"}));
+    EXPECT_EQ(64, RunProgram({kCtl, "--root", "relative/dir", "status"}));
+    EXPECT_EQ(2, RunProgram({kDaemon, "--bogus"}));
+}
+
+TEST_F(ControlTool, WithoutADaemon) {
+    std::string out;
+    EXPECT_EQ(1, Ctl({"status"}, &out));
+    EXPECT_NE(std::string::npos, out.find("state: not_running"));
+    EXPECT_EQ(1, Ctl({"status", "--debug"}, &out));
+    EXPECT_EQ(1, Ctl({"update-alias"}));
+    EXPECT_EQ(1, Ctl({"stop"}));
+    EXPECT_EQ(1, Ctl({"reload"}));
+    // No configuration file: nothing to read the server id from.
+    EXPECT_EQ(5, Ctl({"server-id"}));
+    root.write("/usr/zepa/etc/zeparelayd/zeparelayd.conf",
+               "{\"serverID\": \"ZR9\", \"service\": [{\"id\": \"nos\"}]}");
+    EXPECT_EQ(0, Ctl({"server-id"}, &out));
+    EXPECT_EQ("ZR9\n", out);
+    EXPECT_EQ(0, Ctl({"server-id", "nos"}, &out));
+    EXPECT_EQ(6, Ctl({"server-id", "photo_http"}, &out));
+    EXPECT_EQ("--\n", out);
+}
