@@ -89,12 +89,14 @@ cat >"$stage/usr/zepa/etc/zeparelayd/zeparelayd.conf" <<CONF
 {
    "server_control" : { "protocol" : "https", "host" : "127.0.0.1", "port" : $https_port },
    "server_alias" : { "alias" : "demo-box", "url" : "https://127.0.0.1:$https_port" },
-   "service" : [],
+   "service" : [ { "id" : "nos" }, { "id" : "nos_https" }, { "id" : "http" } ],
    "log_level" : 6,
    "log_file" : "/var/log/zeparelayd.log"
 }
 CONF
 say "$(tr -s ' \n' ' ' <"$stage/usr/zepa/etc/zeparelayd/zeparelayd.conf")"
+say "the services it relays (ports taken from the firewall definitions and router rules):"
+ctl services | sed 's/^/      /'
 
 step "6. Start the daemon (it forks; the exit status is the child's start-up word)"
 set +e

@@ -34,8 +34,8 @@ fw() { # name ports title subtitle
   printf 'name="%s"\ntitle="%s"\nsubtitle="%s"\nprotocol="tcp"\nports="%s"\n' "$1" "$3" "$4" "$2" \
     >"$root/usr/zepa/etc/fw_services/$1.conf"
 }
-fw nos 5000 Management HTTP
-fw nos_https 5001 Management HTTPS
+fw nso 5000 Management HTTP
+fw nso_https 5001 Management HTTPS
 fw http 80 "Web Station" HTTP
 fw https 443 "Web Station" HTTPS
 
@@ -48,11 +48,11 @@ protocol name="tcp"
 enabled="1"
 CONF
 
-# Which services the owner lets through the relay.
+# Which groups of services the owner lets through the relay.
 cat >"$root/usr/zepa/etc/zeparelayd/services.conf" <<'CONF'
 [
-   { "id" : "nos", "enabled" : true },
-   { "id" : "nos_https", "enabled" : true }
+   { "id" : "mobile_apps", "enabled" : true },
+   { "id" : "file_sharing", "enabled" : true }
 ]
 CONF
 

@@ -111,6 +111,7 @@ protected:
              << "  \"server_control\": {\"protocol\": \"https\", \"host\": \"127.0.0.1\", \"port\": "
              << server.httpsPort() << "},\n"
              << "  \"server_alias\": {\"alias\": \"it-box\", \"url\": \"" << server.httpsUrl() << "\"},\n"
+             << "  \"service\": [{\"id\": \"nos\"}, {\"id\": \"nos_https\"}],\n"
              << "  \"log_level\": " << logLevel << ",\n"
              << "  \"log_file\": \"/var/log/zeparelayd.log\"\n"
              << "}\n";
@@ -182,7 +183,10 @@ TEST_F(DaemonProcess, StartsRegistersAndMapsItsAlias) {
     ASSERT_GE(regs.size(), 1u);
     Json::Value body = zepatest::ParseJson(zepatest::RecordedBody(regs[0]));
     EXPECT_EQ("register", body["command"].asString());
-    EXPECT_TRUE(body["services"].isArray());
+    ASSERT_EQ(2u, body["services"].size());
+    EXPECT_EQ("nos", body["services"][0]["id"].asString());
+    EXPECT_EQ(5000, body["services"][0]["port"].asInt());
+    EXPECT_EQ("nos_https", file["service"][1]["id"].asString());
 }
 
 TEST_F(DaemonProcess, SecondStartIsRefused) {

@@ -2,6 +2,7 @@
 
 #include "relay_daemon.h"
 
+#include <libdaemon/dlog.h>
 #include <signal.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -29,12 +30,18 @@ RelayDaemon::RelayDaemon(const std::string& confPath, EventLoop& loop)
       _aliasMapped(false),
       _aliasRetryClass(-1) {}
 
-void RelayDaemon::ApplyLogSettings() {
-    // The configuration names appliance paths; under a staging root they live below it.
-    const std::string file = _conf->logFile.empty() ? std::string() : Paths::Resolve(_conf->logFile);
-    Daemon::SetLogFile(file, _conf->logLevel);
-    ZLOG(ZEPA_LOG_DEBUG, "log level %d, log file [%s]", _conf->logLevel, file.c_str());
+void ApplyLogSettings(const RelaydConf& conf) {
+    const std::string file = conf.logFile.empty() ? std::string() : Paths::Resolve(conf.logFile);
+    // libdaemon 0.14 reports every priority but 7 as invalid when the level is
+    // handed on to it; that false alarm is kept out of the terminal and the log.
+    const daemon_log_flags saved = daemon_log_use;
+    daemon_log_use = static_cast<daemon_log_flags>(0);
+    Daemon::SetLogFile(file, conf.logLevel);
+    daemon_log_use = saved;
+    ZLOG(ZEPA_LOG_DEBUG, "log level %d, log file [%s]", conf.logLevel, file.c_str());
 }
+
+void RelayDaemon::ApplyLogSettings() { zeparelayd::ApplyLogSettings(*_conf); }
 
 bool RelayDaemon::Start() {
     char name[1024];

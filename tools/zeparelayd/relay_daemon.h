@@ -20,6 +20,10 @@
 
 namespace zeparelayd {
 
+// "log_level" and "log_file" of a configuration through Daemon::SetLogFile;
+// the file is an appliance path, taken below the system root.
+void ApplyLogSettings(const ZEPA::Relay::RelaydConf& conf);
+
 // State words as the status readers show them:
 //   2 "starting"   configuration loaded, nothing sent yet
 //   3 "login"      registering with the control server, or waiting to retry
