@@ -2,7 +2,6 @@
 
 #include "relay_daemon.h"
 
-#include <libdaemon/dlog.h>
 #include <signal.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -32,12 +31,7 @@ RelayDaemon::RelayDaemon(const std::string& confPath, EventLoop& loop)
 
 void ApplyLogSettings(const RelaydConf& conf) {
     const std::string file = conf.logFile.empty() ? std::string() : Paths::Resolve(conf.logFile);
-    // libdaemon 0.14 reports every priority but 7 as invalid when the level is
-    // handed on to it; that false alarm is kept out of the terminal and the log.
-    const daemon_log_flags saved = daemon_log_use;
-    daemon_log_use = static_cast<daemon_log_flags>(0);
     Daemon::SetLogFile(file, conf.logLevel);
-    daemon_log_use = saved;
     ZLOG(ZEPA_LOG_DEBUG, "log level %d, log file [%s]", conf.logLevel, file.c_str());
 }
 
