@@ -36,8 +36,8 @@ fw() { # name ports title subtitle
 }
 fw nso 5000 Management HTTP
 fw nso_https 5001 Management HTTPS
-fw http 80 "Web Station" HTTP
-fw https 443 "Web Station" HTTPS
+fw http 80 "Web Server" HTTP
+fw https 443 "Web Server" HTTPS
 
 # The router forwards the management ports.
 cat >"$root/usr/zepa/etc/router/portforward.conf" <<'CONF'

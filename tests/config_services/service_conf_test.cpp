@@ -159,7 +159,7 @@ TEST_F(ServiceConfTest, FirewallNameMapping) {
 }
 
 TEST_F(ServiceConfTest, NamesFromTitlesOrAlternativeTitle) {
-    EXPECT_EQ("Web Station", ServiceConf("http").name);
+    EXPECT_EQ("Web Server", ServiceConf("http").name);
     WriteFwDefinition(root, {"onlytitle", "1", "tcp", "Title", "", "Alt"});
     EXPECT_EQ("Alt", ServiceConf("onlytitle").name);
     WriteFwDefinition(root, {"untitled", "1", "tcp", "", "Sub", ""});

@@ -99,7 +99,7 @@ TEST_F(ServiceListTest, GenerationOnAStagedAppliance) {
     EXPECT_EQ(expected, Listed(c));
 
     EXPECT_EQ("Management:HTTP", c.GetServiceById("support_nos")->name);
-    EXPECT_EQ("Web Station", c.GetServiceById("http")->name);
+    EXPECT_EQ("Web Server", c.GetServiceById("http")->name);
     EXPECT_TRUE(LogContains(log, "Router[80] or source[abc] ports parse failed.")) << log;
     EXPECT_EQ(ParseJson(R"([{"id": "mobile_apps", "enabled": true}, {"id": "picturedock", "enabled": false},
                             {"id": "file_sharing", "enabled": true}, {"id": "nos_portal", "enabled": true},
@@ -111,7 +111,7 @@ TEST_F(ServiceListTest, GenerationOnAStagedAppliance) {
     Json::Value nos = full["service"][0];
     EXPECT_EQ(ParseJson(R"({"id": "nos", "name": "Management:HTTP", "port": 5000, "ext_port": 5000})"), nos);
     Json::Value https = full["service"][8];
-    EXPECT_EQ(ParseJson(R"j({"id": "https", "name": "Web Station (HTTPS)", "port": 443})j"), https);
+    EXPECT_EQ(ParseJson(R"j({"id": "https", "name": "Web Server (HTTPS)", "port": 443})j"), https);
 }
 
 TEST_F(ServiceListTest, RelayOffSupportOnListsOnlySupportEntries) {

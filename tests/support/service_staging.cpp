@@ -22,8 +22,8 @@ void WriteFwDefinition(const TempRoot& root, const FwDefinition& def, const std:
 void WriteStockFwDefinitions(const TempRoot& root) {
     WriteFwDefinition(root, {"nso", "5000", "tcp", "Management", "HTTP", ""});
     WriteFwDefinition(root, {"nso_https", "5001", "tcp", "Management", "HTTPS", ""});
-    WriteFwDefinition(root, {"http", "80", "tcp", "", "", "Web Station"});
-    WriteFwDefinition(root, {"https", "443", "tcp", "", "", "Web Station (HTTPS)"});
+    WriteFwDefinition(root, {"http", "80", "tcp", "", "", "Web Server"});
+    WriteFwDefinition(root, {"https", "443", "tcp", "", "", "Web Server (HTTPS)"});
     WriteFwDefinition(root, {"telnet", "23", "tcp", "", "", "Telnet"});
     WriteFwDefinition(root, {"ssh", "22", "tcp", "", "", "SSH"});
     WriteFwDefinition(root, {"webdav_http", "5005", "tcp", "WebDAV", "HTTP", ""});
