@@ -199,11 +199,11 @@ TEST_F(DaemonProcess, SecondStartIsRefused) {
 
 TEST_F(DaemonProcess, StateWordsFollowWhatTheDaemonDoes) {
     // A refused registration keeps the daemon logging in, with the reason.
-    Json::Value spec;
-    spec["path"] = "/Serv.php";
-    spec["json"]["errno"] = 2;
-    spec["count"] = 1;
-    ASSERT_TRUE(server.scriptRaw(spec));
+    Json::Value plan;
+    plan["path"] = "/Serv.php";
+    plan["json"]["errno"] = 2;
+    plan["count"] = 1;
+    ASSERT_TRUE(server.scriptRaw(plan));
     ASSERT_EQ(0, StartDaemon());
     ASSERT_TRUE(StatusHas("error: err_auth"));
     EXPECT_NE(std::string::npos, CtlStatus().find("state: login"));

@@ -183,39 +183,39 @@ bool LocalServer::control(const std::string& method, const std::string& path, co
     return rc == CURLE_OK;
 }
 
-bool LocalServer::scriptRaw(const Json::Value& spec) {
+bool LocalServer::scriptRaw(const Json::Value& plan) {
     Json::FastWriter writer;
     std::string answer;
     long status = 0;
-    return control("POST", "script", writer.write(spec), answer, status) && status == 200;
+    return control("POST", "script", writer.write(plan), answer, status) && status == 200;
 }
 
 bool LocalServer::script(const std::string& path, int status, const std::string& body, int count,
                          const std::map<std::string, std::string>& headers) {
-    Json::Value spec;
-    spec["path"] = path;
-    spec["status"] = status;
-    spec["body"] = body;
-    spec["count"] = count;
-    for (const auto& h : headers) spec["headers"][h.first] = h.second;
-    return scriptRaw(spec);
+    Json::Value plan;
+    plan["path"] = path;
+    plan["status"] = status;
+    plan["body"] = body;
+    plan["count"] = count;
+    for (const auto& h : headers) plan["headers"][h.first] = h.second;
+    return scriptRaw(plan);
 }
 
 bool LocalServer::hang(const std::string& path, double seconds, int count) {
-    Json::Value spec;
-    spec["path"] = path;
-    spec["action"] = "hang";
-    spec["seconds"] = seconds;
-    spec["count"] = count;
-    return scriptRaw(spec);
+    Json::Value plan;
+    plan["path"] = path;
+    plan["action"] = "hang";
+    plan["seconds"] = seconds;
+    plan["count"] = count;
+    return scriptRaw(plan);
 }
 
 bool LocalServer::scriptAction(const std::string& path, const std::string& action, int count) {
-    Json::Value spec;
-    spec["path"] = path;
-    spec["action"] = action;
-    spec["count"] = count;
-    return scriptRaw(spec);
+    Json::Value plan;
+    plan["path"] = path;
+    plan["action"] = action;
+    plan["count"] = count;
+    return scriptRaw(plan);
 }
 
 Json::Value LocalServer::requests(const std::string& path) const {

@@ -52,7 +52,7 @@ public:
     // action "close" (no answer) or "reset" (TCP reset) for the next count.
     bool scriptAction(const std::string& path, const std::string& action, int count = 1);
     // Any script object of the control API.
-    bool scriptRaw(const Json::Value& spec);
+    bool scriptRaw(const Json::Value& plan);
     // Every recorded request (of path, when given), in arrival order.
     Json::Value requests(const std::string& path = "") const;
     // Forgets records and scripts.

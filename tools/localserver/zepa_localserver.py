@@ -151,17 +151,17 @@ def text_reply(text, status=200, headers=None):
     return Reply(status, text, headers, content_type="text/plain")
 
 
-def _script_reply(spec):
+def _script_reply(plan):
     body = b""
-    if "json" in spec:
-        body = json.dumps(spec["json"]).encode("utf-8")
-    elif "body_base64" in spec:
-        body = base64.b64decode(spec["body_base64"])
-    elif "body" in spec:
-        body = spec["body"].encode("utf-8")
-    action = spec.get("action", "reply")
-    seconds = float(spec.get("seconds", 30.0 if action == "hang" else 0.0))
-    return Reply(int(spec.get("status", 200)), body, spec.get("headers") or {}, action, seconds)
+    if "json" in plan:
+        body = json.dumps(plan["json"]).encode("utf-8")
+    elif "body_base64" in plan:
+        body = base64.b64decode(plan["body_base64"])
+    elif "body" in plan:
+        body = plan["body"].encode("utf-8")
+    action = plan.get("action", "reply")
+    seconds = float(plan.get("seconds", 30.0 if action == "hang" else 0.0))
+    return Reply(int(plan.get("status", 200)), body, plan.get("headers") or {}, action, seconds)
 
 
 class LocalServer:
@@ -208,11 +208,11 @@ class LocalServer:
             queue = self.scripts.get(path)
             if not queue:
                 return None
-            spec = queue[0]
-            spec["count"] -= 1
-            if spec["count"] <= 0:
+            plan = queue[0]
+            plan["count"] -= 1
+            if plan["count"] <= 0:
                 queue.pop(0)
-            return _script_reply(spec)
+            return _script_reply(plan)
 
     def dispatch(self, req):
         if req.path.startswith(CONTROL_PREFIX):
@@ -234,12 +234,12 @@ class LocalServer:
         if name == "ping":
             return json_reply({"ok": True})
         if name == "script" and req.method == "POST":
-            spec = req.json()
-            if "path" not in spec:
+            plan = req.json()
+            if "path" not in plan:
                 return json_reply({"ok": False, "error": "path missing"}, 400)
-            spec["count"] = int(spec.get("count", 1))
+            plan["count"] = int(plan.get("count", 1))
             with self.lock:
-                self.scripts.setdefault(spec["path"], []).append(spec)
+                self.scripts.setdefault(plan["path"], []).append(plan)
             return json_reply({"ok": True})
         if name == "requests":
             path = req.params().get("path")
@@ -398,10 +398,10 @@ def load_routes(app, routes_dir):
     sys.modules.setdefault("zepa_localserver", sys.modules[__name__])
     for path in sorted(glob.glob(os.path.join(routes_dir, "routes_*.py"))):
         name = "zepa_" + os.path.splitext(os.path.basename(path))[0]
-        spec = importlib.util.spec_from_file_location(name, path)
-        module = importlib.util.module_from_spec(spec)
+        plan = importlib.util.spec_from_file_location(name, path)
+        module = importlib.util.module_from_spec(plan)
         sys.modules[name] = module
-        spec.loader.exec_module(module)
+        plan.loader.exec_module(module)
         if hasattr(module, "register"):
             module.register(app)
         for route_path, handler in getattr(module, "ROUTES", {}).items():
