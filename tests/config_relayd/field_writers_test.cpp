@@ -7,6 +7,7 @@
 
 #include <zeparelayd/config.h>
 
+#include "conf_file_fixture.h"
 #include "support/test_support.h"
 
 using namespace ZEPA::Relay;
@@ -17,15 +18,14 @@ using zepatest::StderrCapture;
 
 namespace {
 
-constexpr const char kConf[] = "/usr/zepa/etc/zeparelayd/zeparelayd.conf";
+using relaydtest::kConf;
 constexpr const char kNotifier[] = "/usr/zepa/bin/zepanosnotify";
 constexpr const char kNotices[] = "/notices.log";
 
-class FieldWriterTest : public RootTest {
+class FieldWriterTest : public relaydtest::ConfFileTest {
 protected:
     void SetUp() override {
-        RootTest::SetUp();
-        root.mkdir("/usr/zepa/etc/zeparelayd");
+        ConfFileTest::SetUp();
         // A stand-in notifier that records its arguments, one line per run.
         root.write(kNotifier,
                    "#!/bin/sh\n"
@@ -34,9 +34,6 @@ protected:
                        root.path(kNotices) + "'\n",
                    0755);
     }
-    std::string conf() const { return root.path(kConf); }
-    void WriteConf(const std::string& text) { root.write(kConf, text); }
-    Json::Value ConfOnDisk() const { return ParseJson(root.read(kConf)); }
     std::vector<std::string> Notices() const {
         std::vector<std::string> lines;
         if (!root.exists(kNotices)) return lines;

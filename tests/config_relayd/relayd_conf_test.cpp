@@ -6,6 +6,7 @@
 
 #include <zeparelayd/config.h>
 
+#include "conf_file_fixture.h"
 #include "support/service_staging.h"
 #include "support/test_support.h"
 
@@ -20,18 +21,14 @@ using zepatest::StderrCapture;
 
 namespace {
 
-constexpr const char kConf[] = "/usr/zepa/etc/zeparelayd/zeparelayd.conf";
+using relaydtest::kConf;
 
-class RelaydConfTest : public RootTest {
+class RelaydConfTest : public relaydtest::ConfFileTest {
 protected:
     void SetUp() override {
-        RootTest::SetUp();
+        ConfFileTest::SetUp();
         zepatest::WriteStockFwDefinitions(root);
-        root.mkdir("/usr/zepa/etc/zeparelayd");
     }
-    std::string conf() const { return root.path(kConf); }
-    void WriteConf(const std::string& text) { root.write(kConf, text); }
-    Json::Value ConfOnDisk() const { return ParseJson(root.read(kConf)); }
 
     static void ExpectDefaults(const RelaydConf& c) {
         EXPECT_EQ("", c.serverID);
