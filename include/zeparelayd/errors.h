@@ -74,6 +74,21 @@ ZEPARELAYD_API RELAYD_RET RespErrMap(RELAYSERVER_ERR err);
 // The "errno" carried by a server answer; RELAYSERVER_ERR_UNKNOWN when there is none.
 ZEPARELAYD_API RELAYSERVER_ERR ParseServerError(const Json::Value& answer);
 
+// Credentials never reach a log, status file, debug dump or printed form. One
+// list of credential keys serves every place that shows configuration,
+// request bodies or request descriptions.
+
+// True when values stored under key are credentials ("token", "key",
+// "auth_key", "myhub_password", "relay_pass", ...). Exact, case-sensitive.
+ZEPARELAYD_API bool IsSecretKey(const std::string& key);
+// A deep copy of value in which the value of every secret key, at any depth
+// of objects and arrays, is replaced by the string "***".
+ZEPARELAYD_API Json::Value MaskSecrets(const Json::Value& value);
+// An url-encoded form body ("name=value&name=value...") with the value of
+// every secret name replaced by "***"; pieces without "=" and other names
+// stay as they are, in their order.
+ZEPARELAYD_API std::string MaskFormSecrets(const std::string& body);
+
 }  // namespace Relay
 }  // namespace ZEPA
 

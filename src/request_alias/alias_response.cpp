@@ -4,7 +4,9 @@
 #include <curl/curl.h>
 #include <json/reader.h>
 
+#include <zeparelayd/errors.h>
 #include <zeparelayd/request_alias.h>
+#include <cctype>
 #include <sstream>
 
 #include "common/log.h"
@@ -49,28 +51,49 @@ bool ParseJsonObject(const std::string& text, Json::Value& out) {
     return true;
 }
 
-// The form body with the values of credential fields replaced, for the log.
-std::string MaskCredentials(const std::string& body) {
-    static const char* const kSecret[] = {"token", "key", "myhub_password", "auth_key"};
-    std::istringstream pieces(body);
-    std::string piece;
+// Percent-decoding of one form value, as curl_easy_escape wrote it.
+std::string FormDecode(const std::string& value) {
     std::string out;
-    bool first = true;
-    while (std::getline(pieces, piece, '&')) {
-        const std::string name = piece.substr(0, piece.find('='));
-        for (const char* secret : kSecret) {
-            if (name == secret && name.size() < piece.size()) piece = name + "=***";
+    for (std::string::size_type i = 0; i < value.size(); ++i) {
+        if (value[i] == '%' && i + 2 < value.size() && isxdigit(static_cast<unsigned char>(value[i + 1])) &&
+            isxdigit(static_cast<unsigned char>(value[i + 2]))) {
+            out += static_cast<char>(std::stoi(value.substr(i + 1, 2), nullptr, 16));
+            i += 2;
+        } else {
+            out += value[i];
         }
-        out += first ? "" : "&";
-        out += piece;
-        first = false;
     }
     return out;
 }
 
-}  // namespace
+void ReplaceAll(std::string& text, const std::string& what, const std::string& with) {
+    if (what.empty()) return;
+    for (std::string::size_type at = text.find(what); at != std::string::npos;
+         at = text.find(what, at + with.size())) {
+        text.replace(at, what.size(), with);
+    }
+}
 
-bool AliasRequest::ParseCURLHttp(HTTPResponse& r, ALIAS_RET& ret, std::string& body, int& httpStatus) {
+// An answer as the log may show it: form-like credentials masked, and every
+// credential the request sent (encoded or not) masked wherever the server
+// repeated it.
+std::string MaskAnswer(const std::string& answer, const std::string& sent) {
+    std::string out = MaskFormSecrets(answer);
+    std::istringstream pieces(sent);
+    std::string piece;
+    while (std::getline(pieces, piece, '&')) {
+        const std::string::size_type eq = piece.find('=');
+        if (eq == std::string::npos || !IsSecretKey(piece.substr(0, eq))) continue;
+        const std::string value = piece.substr(eq + 1);
+        ReplaceAll(out, value, "***");
+        ReplaceAll(out, FormDecode(value), "***");
+    }
+    return out;
+}
+
+// The answer checks of the three ParseCURLHttp forms; sent is the request's
+// body, for masking what the log shows of the answer.
+bool ParseHttp(HTTPResponse& r, const std::string& sent, ALIAS_RET& ret, std::string& body, int& httpStatus) {
     if (r.curlCode != CURLE_OK) {
         LogCurlError(r.curlCode);
         ret = ClassifyCurlCode(r.curlCode);
@@ -78,8 +101,8 @@ bool AliasRequest::ParseCURLHttp(HTTPResponse& r, ALIAS_RET& ret, std::string& b
     }
     g_lastLoggedCurlCode = 0;
 
-    Trim(r.body);
-    ZLOG(ZEPA_LOG_DEBUG, "HTTP: %d, Response: %s", r.httpStatus, r.body.c_str());
+    AliasRequest::Trim(r.body);
+    ZLOG(ZEPA_LOG_DEBUG, "HTTP: %d, Response: %s", r.httpStatus, MaskAnswer(r.body, sent).c_str());
     httpStatus = r.httpStatus;
     if (r.httpStatus == 200) {
         body = r.body;
@@ -91,15 +114,21 @@ bool AliasRequest::ParseCURLHttp(HTTPResponse& r, ALIAS_RET& ret, std::string& b
     return false;
 }
 
+}  // namespace
+
+bool AliasRequest::ParseCURLHttp(HTTPResponse& r, ALIAS_RET& ret, std::string& body, int& httpStatus) {
+    return ParseHttp(r, std::string(), ret, body, httpStatus);
+}
+
 bool AliasRequest::ParseCURLHttp(boost::shared_ptr<Request> req, ALIAS_RET& ret, std::string& body) {
     HTTPResponse r(req->GetHttpStatus(), req->GetResponse(), req->GetCurlResult());
     int ignoredStatus = -1;
-    return ParseCURLHttp(r, ret, body, ignoredStatus);
+    return ParseHttp(r, req->GetData(), ret, body, ignoredStatus);
 }
 
 bool AliasRequest::ParseCURLHttp(ALIAS_RET& ret, std::string& body, int& httpStatus) {
     HTTPResponse r(_request.GetHttpStatus(), _request.GetResponse(), _request.GetCurlResult());
-    return ParseCURLHttp(r, ret, body, httpStatus);
+    return ParseHttp(r, _request.GetData(), ret, body, httpStatus);
 }
 
 bool AliasRequest::Send(ALIAS_RET& ret, ALIAS_RESPONSE_TYPE& type) {
@@ -146,7 +175,7 @@ bool AliasRequest::GetResponseForDaemon(boost::shared_ptr<Request> req, ALIAS_RE
         return false;
     }
     if (!ParseServerResponse(body, code)) {
-        ZLOG(ZEPA_LOG_ERR, "Unknown response: %s", body.c_str());
+        ZLOG(ZEPA_LOG_ERR, "Unknown response: %s", MaskAnswer(body, req->GetData()).c_str());
         return false;
     }
     const std::string::size_type colon = body.find(':');
@@ -167,7 +196,7 @@ bool AliasRequest::GetAliasName(boost::shared_ptr<Request> req, std::string& ali
         return true;
     }
     // Credentials never reach the log: their values are masked in the body shown.
-    ZLOG(ZEPA_LOG_ERR, "not found alias name from post data [%s]", MaskCredentials(data).c_str());
+    ZLOG(ZEPA_LOG_ERR, "not found alias name from post data [%s]", MaskFormSecrets(data).c_str());
     return false;
 }
 
