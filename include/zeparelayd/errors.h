@@ -31,6 +31,15 @@ enum RELAYD_RET : int {
     RELAYD_ERR_UNKNOWN = 255,
 };
 
+// Small results of the process-control, status and entry-point functions
+// (Daemon::Signal, GetStatus, DebugStatus, UpdateAlias, ...). 11 and 255 are
+// the values of RELAYD_ERR_LOCK and RELAYD_ERR_UNKNOWN.
+constexpr int RELAYD_RESULT_OK = 0;           // done; the daemon runs
+constexpr int RELAYD_RESULT_NOT_RUNNING = 1;  // the daemon does not run
+constexpr int RELAYD_RESULT_UNAVAILABLE = 2;  // not delivered or not available
+constexpr int RELAYD_RESULT_BUSY = 11;        // another caller holds the lock
+constexpr int RELAYD_RESULT_BROKEN = 255;     // a status or debug file is broken
+
 // State of the daemon ("state" in the status file). 5 and 6 share a word.
 enum RELAYD_STATE : unsigned int {
     RELAYD_STATE_NOT_RUNNING = 1,

@@ -9,9 +9,12 @@
 #include <zeparelayd/daemon.h>
 
 #include "common/paths.h"
+#include "daemon/service_ids.h"
 
 using ZEPA::Relay::Daemon;
+using ZEPA::Relay::ListsServiceId;
 using ZEPA::Relay::RelaydConf;
+using ZEPA::Relay::ServiceIdMatch;
 
 namespace {
 
@@ -23,16 +26,6 @@ std::string ConfPath() { return ZEPA::Relay::Paths::Resolve(ZEPA::Relay::Paths::
 void NotifyDaemon() {
     Daemon::LibInit();
     Daemon::Hup();
-}
-
-bool ListsService(const Json::Value& conf, const char* serviceId) {
-    const Json::Value& services = conf["service"];
-    if (!services.isArray()) return false;
-    for (const Json::Value& service : services) {
-        if (service.isObject() && service["id"].isString() && service["id"].asString() == serviceId)
-            return true;
-    }
-    return false;
 }
 
 }  // namespace
@@ -70,5 +63,5 @@ int VLIBRelaydGetServerId(const char* serviceId, char* buf, unsigned int size) {
     if (serverId.empty()) return 0;
     if (hasBuffer) snprintf(buf, size, "%s", serverId.c_str());
     if (serviceId == nullptr) return 1;
-    return ListsService(conf, serviceId) ? 1 : 0;
+    return ListsServiceId(conf, serviceId, ServiceIdMatch::STRING_ONLY) ? 1 : 0;
 }

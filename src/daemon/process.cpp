@@ -15,6 +15,8 @@
 #include <cstdlib>
 #include <cstring>
 
+#include <zeparelayd/errors.h>
+
 #include "common/log.h"
 #include "common/paths.h"
 
@@ -116,25 +118,25 @@ int Daemon::InitSignalHandler() {
 int Daemon::Signal(int sig) {
     if (daemon_pid_file_kill(sig) < 0) {
         ZLOG(ZEPA_LOG_NOTICE, "Failed to signal daemon, %d", sig);
-        return 2;
+        return RELAYD_RESULT_UNAVAILABLE;
     }
-    return 0;
+    return RELAYD_RESULT_OK;
 }
 
 int Daemon::Kill() {
     if (daemon_pid_file_kill(SIGTERM) < 0) {
         ZLOG(ZEPA_LOG_NOTICE, "Failed to kill daemon");
-        return 2;
+        return RELAYD_RESULT_UNAVAILABLE;
     }
-    return 0;
+    return RELAYD_RESULT_OK;
 }
 
 int Daemon::Hup() {
     if (daemon_pid_file_kill(SIGHUP) < 0) {
         fprintf(stderr, "%s not running\n", daemon_pid_file_ident != nullptr ? daemon_pid_file_ident : "");
-        return 2;
+        return RELAYD_RESULT_UNAVAILABLE;
     }
-    return 0;
+    return RELAYD_RESULT_OK;
 }
 
 }  // namespace Relay

@@ -17,6 +17,7 @@
 
 #include "common/log.h"
 #include "common/paths.h"
+#include "daemon/service_ids.h"
 #include "daemon/status_file.h"
 #include "daemon/status_seam.h"
 
@@ -24,11 +25,6 @@ namespace ZEPA {
 namespace Relay {
 
 namespace {
-
-const int RUNNING = 0;
-const int NOT_RUNNING = 1;
-const int BUSY = 11;
-const int BROKEN = 255;
 
 const int STATE_NOT_RUNNING = 1;
 const int ERROR_NONE = 0;
@@ -63,17 +59,6 @@ RELAYD_RET ErrorCode(int errorNo) {
     return static_cast<RELAYD_RET>(errorNo);
 }
 
-bool RelaysService(const Json::Value& status, const char* serviceId) {
-    const Json::Value& services = status["service"];
-    if (!services.isArray()) return false;
-    for (const Json::Value& service : services) {
-        if (!service.isObject()) continue;
-        const Json::Value& id = service["id"];
-        if (id.isConvertibleTo(Json::stringValue) && id.asString() == serviceId) return true;
-    }
-    return false;
-}
-
 // Reads the dump the daemon writes after SIGUSR1; the caller holds the lock.
 int ReadDebugDump(const std::string& path, Json::Value& out) {
     g_statusSleep(FIRST_PAUSE_US);
@@ -82,18 +67,18 @@ int ReadDebugDump(const std::string& path, Json::Value& out) {
         if (!in.is_open()) {
             ZSYSLOG(LOG_ERR, "zeparelayd status file is not ready");
             unlink(path.c_str());
-            return BROKEN;
+            return RELAYD_RESULT_BROKEN;
         }
         if (ParseStream(in, out)) {
             in.close();
             unlink(path.c_str());
-            return RUNNING;
+            return RELAYD_RESULT_OK;
         }
         if (attempt == PARSE_ATTEMPTS) {
             ZSYSLOG(LOG_DEBUG, "zeparelayd status parse failed");
             in.close();
             unlink(path.c_str());
-            return BUSY;
+            return RELAYD_RESULT_BUSY;
         }
         g_statusSleep(RETRY_PAUSE_US);
     }
@@ -106,24 +91,24 @@ void (*g_statusSleep)(unsigned int usec) = Usleep;
 int LoadStatusFile(Json::Value& out, pid_t& pid) {
     out = Json::Value();
     std::ifstream in(Paths::Resolve(Paths::STATUS_FILE));
-    if (!in.is_open()) return NOT_RUNNING;
+    if (!in.is_open()) return RELAYD_RESULT_NOT_RUNNING;
     if (!ParseStream(in, out)) {
         ZSYSLOG(LOG_ERR, "bad zeparelayd status file");
-        return BROKEN;
+        return RELAYD_RESULT_BROKEN;
     }
     if (!out.isObject() || !out.isMember("pid") || !out["pid"].isInt() || out["pid"].asInt() == -1) {
         ZSYSLOG(LOG_ERR, "bad zeparelayd status pid");
-        return BROKEN;
+        return RELAYD_RESULT_BROKEN;
     }
     pid = out["pid"].asInt();
-    return RUNNING;
+    return RELAYD_RESULT_OK;
 }
 
 int Daemon::GetStatus(Json::Value& out) {
     pid_t pid = 0;
     int ret = LoadStatusFile(out, pid);
-    if (ret != RUNNING) return ret;
-    return kill(pid, 0) == 0 ? RUNNING : NOT_RUNNING;
+    if (ret != RELAYD_RESULT_OK) return ret;
+    return kill(pid, 0) == 0 ? RELAYD_RESULT_OK : RELAYD_RESULT_NOT_RUNNING;
 }
 
 bool Daemon::GetStatus(std::string& serverId, std::string& state, std::string& error, const char* serviceId) {
@@ -136,9 +121,9 @@ bool Daemon::GetStatus(std::string& serverId, std::string& state, std::string& e
     if (file.isObject() && file["serverID"].isString()) serverId = file["serverID"].asString();
     int stateNo = IntMember(file, "state", STATE_NOT_RUNNING);
     int errorNo = IntMember(file, "error", ERROR_NONE);
-    if (probe == BROKEN) return false;
+    if (probe == RELAYD_RESULT_BROKEN) return false;
     // A stale file or a service not relayed both read as "not running".
-    bool relayed = probe == RUNNING && (serviceId == nullptr || RelaysService(file, serviceId));
+    bool relayed = probe == RELAYD_RESULT_OK && (serviceId == nullptr || ListsServiceId(file, serviceId, ServiceIdMatch::AS_STRING));
     if (!relayed) {
         stateNo = STATE_NOT_RUNNING;
         errorNo = ERROR_NONE;
@@ -153,17 +138,17 @@ int Daemon::DebugStatus(Json::Value& out) {
     LibInit();
     out = Json::Value();
     pid_t pid = daemon_pid_file_is_running();
-    if (pid < 0) return NOT_RUNNING;
+    if (pid < 0) return RELAYD_RESULT_NOT_RUNNING;
     const std::string path = DebugFilePath(pid);
     FileLock lock(path.c_str());
     if (!lock.Lock(LOCK_EX)) {
         ZSYSLOG(LOG_INFO, "lock failed");
-        return BUSY;
+        return RELAYD_RESULT_BUSY;
     }
     if (daemon_pid_file_kill(SIGUSR1) < 0) {
         // The empty debug file is left behind on purpose.
         ZSYSLOG(LOG_ERR, "daemon is not running");
-        return NOT_RUNNING;
+        return RELAYD_RESULT_NOT_RUNNING;
     }
     return ReadDebugDump(path, out);
 }

@@ -9,6 +9,8 @@
 #include <zeparelayd/config.h>
 #include <zeparelayd/config_alias.h>
 
+#include <zeparelayd/errors.h>
+
 #include "common/log.h"
 #include "common/paths.h"
 #include "daemon/status_file.h"
@@ -17,8 +19,6 @@ namespace ZEPA {
 namespace Relay {
 
 namespace {
-
-const int RUNNING = 0;
 
 void PrintLine(const char* label, const std::string& value) { std::cout << label << value << std::endl; }
 
@@ -31,7 +31,7 @@ int PrintStatusReport() {
     std::string serverId, state, error;
     if (!Daemon::GetStatus(serverId, state, error, nullptr)) {
         std::cout << "get status failed" << std::endl;
-        return 2;
+        return RELAYD_RESULT_UNAVAILABLE;
     }
     const std::string aliasName = conf.alias.GetAliasName();
     std::string aliasWord, unused;
@@ -41,14 +41,14 @@ int PrintStatusReport() {
     PrintLine("alias: ", aliasName);
     PrintLine("alias_status: ", aliasWord);
     if (error != "success") PrintLine("error: ", error);
-    return state == "not_running" ? 1 : 0;
+    return state == "not_running" ? RELAYD_RESULT_NOT_RUNNING : RELAYD_RESULT_OK;
 }
 
 int Daemon::Status(bool debug) {
     if (debug) {
         Json::Value dump;
         int ret = DebugStatus(dump);
-        if (ret == RUNNING) {
+        if (ret == RELAYD_RESULT_OK) {
             Json::FastWriter writer;
             std::cout << writer.write(dump) << std::flush;
         } else {

@@ -3,6 +3,8 @@
 
 #include <csignal>
 
+#include <zeparelayd/errors.h>
+
 #include "common/log.h"
 #include "daemon/status_file.h"
 
@@ -13,9 +15,9 @@ int Daemon::UpdateAlias() {
     Json::Value status;
     pid_t pid = 0;
     int ret = LoadStatusFile(status, pid);
-    if (ret != 0) return ret;
+    if (ret != RELAYD_RESULT_OK) return ret;
     // SIGRTMIN is a run-time value on Linux, never a constant.
-    return kill(pid, SIGRTMIN + 1) == 0 ? 0 : 1;
+    return kill(pid, SIGRTMIN + 1) == 0 ? RELAYD_RESULT_OK : RELAYD_RESULT_NOT_RUNNING;
 }
 
 }  // namespace Relay

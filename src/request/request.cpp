@@ -7,6 +7,7 @@
 #include <cstring>
 
 #include "common/log.h"
+#include "request/curl_class.h"
 #include "request/request_internal.h"
 
 // Sets one option; on failure logs "set <OPTION>to curl handle failed" (no
@@ -262,19 +263,14 @@ RELAYD_RET Request::GetError() const {
         ZLOG(ZEPA_LOG_ERR, "curl error: %d, %s", _curlResult, curl_easy_strerror(_curlResult));
         g_lastLoggedCurlError = _curlResult;
     }
-    switch (_curlResult) {
-        case CURLE_COULDNT_RESOLVE_HOST:
+    switch (ClassifyCurlCode(_curlResult)) {
+        case CurlFailure::RESOLVE:
             return RELAYD_ERR_RESOLV;
-        case CURLE_COULDNT_CONNECT:
-        case CURLE_OPERATION_TIMEDOUT:
-        case CURLE_SSL_CONNECT_ERROR:
-        case CURLE_SEND_ERROR:
-        case CURLE_RECV_ERROR:
-        case CURLE_AGAIN:
+        case CurlFailure::NETWORK:
             return RELAYD_ERR_NETWORK;
         default:
-            // 2 has no name of its own among the results.
-            return static_cast<RELAYD_RET>(2);
+            // 2 has no member of its own among the results.
+            return static_cast<RELAYD_RET>(RELAYD_RESULT_UNAVAILABLE);
     }
 }
 

@@ -4,6 +4,7 @@
 
 #include <json/reader.h>
 #include <json/writer.h>
+#include <zeparelayd/errors.h>
 #include <zeparelayd/request.h>
 
 #include "common/log.h"
@@ -27,6 +28,21 @@ bool Parse(const std::string& text, Json::Value& out) {
     }
     ZLOG(ZEPA_LOG_DEBUG, "failed to parse response: %s", text.c_str());
     return false;
+}
+
+// The body as a description may show it: credentials masked, otherwise the
+// text as it stands.
+std::string MaskedBody(const std::string& data) {
+    Json::Value parsed;
+    Json::Reader reader;
+    if (!data.empty() && (data[0] == '{' || data[0] == '[') && reader.parse(data, parsed, false)) {
+        const Json::Value masked = MaskSecrets(parsed);
+        if (masked == parsed) return data;
+        std::string text = Serialise(masked);
+        if (!text.empty() && text.back() == '\n') text.pop_back();
+        return text;
+    }
+    return MaskFormSecrets(data);
 }
 
 }  // namespace
@@ -73,7 +89,8 @@ bool Request::GetResponse(Json::Value& out) const {
 
 bool Request::Write(Json::Value& out) const {
     out["url"] = _url;
-    out["data"] = _data;
+    // Descriptions end in logs and dumps: never with a credential in them.
+    out["data"] = MaskedBody(_data);
     out["mode"] = _async ? "async" : "sync";
     if (_done) {
         out["http_status"] = static_cast<int>(_httpStatus);

@@ -10,6 +10,7 @@
 #include <sstream>
 
 #include "common/log.h"
+#include "request/curl_class.h"
 
 namespace ZEPA {
 namespace Relay {
@@ -26,16 +27,11 @@ void LogCurlError(int code) {
     g_lastLoggedCurlCode = code;
 }
 
-ALIAS_RET ClassifyCurlCode(int code) {
-    switch (code) {
-        case CURLE_COULDNT_RESOLVE_HOST:
+ALIAS_RET AliasResultOf(int code) {
+    switch (ClassifyCurlCode(code)) {
+        case CurlFailure::RESOLVE:
             return ALIAS_RET_DNS;
-        case CURLE_COULDNT_CONNECT:
-        case CURLE_OPERATION_TIMEDOUT:
-        case CURLE_SSL_CONNECT_ERROR:
-        case CURLE_SEND_ERROR:
-        case CURLE_RECV_ERROR:
-        case CURLE_AGAIN:
+        case CurlFailure::NETWORK:
             return ALIAS_RET_NETWORK;
         default:
             return ALIAS_RET_UNKNOWN;
@@ -96,7 +92,7 @@ std::string MaskAnswer(const std::string& answer, const std::string& sent) {
 bool ParseHttp(HTTPResponse& r, const std::string& sent, ALIAS_RET& ret, std::string& body, int& httpStatus) {
     if (r.curlCode != CURLE_OK) {
         LogCurlError(r.curlCode);
-        ret = ClassifyCurlCode(r.curlCode);
+        ret = AliasResultOf(r.curlCode);
         return false;
     }
     g_lastLoggedCurlCode = 0;

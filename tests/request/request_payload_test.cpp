@@ -256,3 +256,39 @@ TEST_F(RequestPayload, JsonQueryWithTheWritersNewlineIsRefusedByLibcurl) {
     EXPECT_EQ(2, static_cast<int>(request.GetError()));
     EXPECT_EQ(0u, server.requests().size());
 }
+
+TEST_F(RequestPayload, RecordMasksCredentialsOfAFormBody) {
+    Request request(server.httpUrl("/test/json").c_str(), "alias=home&token=t0k3n&key=k%2B1", true);
+    Json::Value record;
+    request.Write(record);
+    EXPECT_EQ("alias=home&token=***&key=***", record["data"].asString());
+    // The body sent is the real one.
+    EXPECT_EQ("alias=home&token=t0k3n&key=k%2B1", request.GetData());
+}
+
+TEST_F(RequestPayload, RecordMasksCredentialsOfAJsonBody) {
+    Json::Value body(Json::objectValue);
+    body["identity"]["key"] = "api-k3y";
+    body["identity"]["serial"] = "SN1";
+    body["relay_pass"] = "pw";
+    Request request(server.httpUrl("/test/json"), body, true);
+    Json::Value record;
+    request.Write(record);
+    const std::string data = record["data"].asString();
+    EXPECT_EQ(std::string::npos, data.find("api-k3y")) << data;
+    const Json::Value shown = zepatest::ParseJson(data);
+    EXPECT_EQ("***", shown["identity"]["key"].asString());
+    EXPECT_EQ("SN1", shown["identity"]["serial"].asString());
+    EXPECT_EQ("***", shown["relay_pass"].asString());
+    Json::Value sent;
+    ASSERT_TRUE(request.GetData(sent));
+    EXPECT_EQ(body, sent);
+}
+
+TEST_F(RequestPayload, RecordKeepsABodyWithoutCredentialsAsItStands) {
+    const char text[] = "{ \"a\" : [1, 2] }";
+    Request request(server.httpUrl("/test/json").c_str(), text, true);
+    Json::Value record;
+    request.Write(record);
+    EXPECT_EQ(text, record["data"].asString());
+}
