@@ -11,6 +11,7 @@
 
 #include "common/log.h"
 #include "common/paths.h"
+#include "config/json_take.h"
 
 namespace ZEPA {
 namespace Relay {
@@ -20,10 +21,6 @@ namespace {
 const int TOKEN_SIZE = 33;
 const int SERIAL_SIZE = 36;
 const int TEXT_SIZE = 1024;
-
-void TakeString(const Json::Value& value, const char* key, std::string& member) {
-    if (value.isMember(key) && value[key].isString()) member = value[key].asString();
-}
 
 }  // namespace
 
@@ -66,11 +63,8 @@ bool AuthConf::Overwrite(const Json::Value& value) {
     if (!value.isObject()) return true;
     std::string newSerial;
     std::string newToken;
-    TakeString(value, "serial", newSerial);
-    TakeString(value, "token", newToken);
-    TakeString(value, "mac", mac);
-    TakeString(value, "key", key);
-    TakeString(value, "model", model);
+    JsonTake::TakeAll(
+        value, {{"serial", newSerial}, {"token", newToken}, {"mac", mac}, {"key", key}, {"model", model}});
 
     // A token without its serial means nothing; keep the pair as it was.
     if (newSerial.empty()) return true;

@@ -2,6 +2,8 @@
 
 #include <zeparelayd/config.h>
 
+#include "config/json_take.h"
+
 namespace ZEPA {
 namespace Relay {
 
@@ -15,8 +17,7 @@ MyHubConf::~MyHubConf() = default;
 
 bool MyHubConf::Overwrite(const Json::Value& value) {
     if (!value.isObject()) return true;
-    if (value.isMember("account") && value["account"].isString()) _account = value["account"].asString();
-    if (value.isMember("host") && value["host"].isString()) _host = value["host"].asString();
+    JsonTake::TakeAll(value, {{"account", _account}, {"host", _host}});
     return true;
 }
 

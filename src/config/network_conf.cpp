@@ -14,6 +14,7 @@
 
 #include "common/log.h"
 #include "common/paths.h"
+#include "config/json_take.h"
 
 namespace ZEPA {
 namespace Relay {
@@ -29,10 +30,6 @@ const int PPPOE_ADDR_SIZE = 46;
 const int GATEWAY_SIZE = 20;
 const int DDNS_SELECT_SIZE = 128;
 const int FQDN_SIZE = 1024;
-
-void TakeString(const Json::Value& value, const char* key, std::string& member) {
-    if (value.isMember(key) && value[key].isString()) member = value[key].asString();
-}
 
 uint32_t Word(const unsigned char* bytes, int i) {
     return (uint32_t(bytes[4 * i]) << 24) | (uint32_t(bytes[4 * i + 1]) << 16) |
@@ -90,9 +87,7 @@ InterfaceConf::~InterfaceConf() = default;
 
 bool InterfaceConf::Overwrite(const Json::Value& value) {
     if (!value.isObject()) return true;
-    TakeString(value, "ip", address);
-    TakeString(value, "mask", mask);
-    TakeString(value, "name", name);
+    JsonTake::TakeAll(value, {{"ip", address}, {"mask", mask}, {"name", name}});
     return true;
 }
 
@@ -199,9 +194,7 @@ void NetworkConf::ReadDdns() {
 
 bool NetworkConf::Overwrite(const Json::Value& value) {
     if (!value.isObject()) return true;
-    TakeString(value, "ddns", ddns);
-    TakeString(value, "gateway", gateway);
-    TakeString(value, "mode", mode);
+    JsonTake::TakeAll(value, {{"ddns", ddns}, {"gateway", gateway}, {"mode", mode}});
     if (!value.isMember("interface") || !value["interface"].isArray()) return true;
     interfaces.clear();
     for (const Json::Value& element : value["interface"]) {

@@ -10,6 +10,7 @@
 
 #include "common/log.h"
 #include "common/paths.h"
+#include "config/json_take.h"
 
 namespace ZEPA {
 namespace Relay {
@@ -61,9 +62,7 @@ RelaydConf::~RelaydConf() = default;
 
 bool RelaydConf::Overwrite(const Json::Value& value) {
     if (!value.isObject()) return false;
-    if (value["serverID"].isString()) serverID = value["serverID"].asString();
-    if (value["log_level"].isInt()) logLevel = value["log_level"].asInt();
-    if (value["log_file"].isString()) logFile = value["log_file"].asString();
+    JsonTake::TakeAll(value, {{"serverID", serverID}, {"log_level", logLevel}, {"log_file", logFile}});
     ForEachSectionKey(*this, [&value](const char* key, Config& section) {
         if (value.isMember(key)) section.Overwrite(value[key]);
     });

@@ -3,6 +3,7 @@
 #include <zeparelayd/config.h>
 
 #include "common/paths.h"
+#include "config/json_take.h"
 
 namespace ZEPA {
 namespace Relay {
@@ -26,11 +27,8 @@ ServerConf::~ServerConf() = default;
 
 bool ServerConf::Overwrite(const Json::Value& value) {
     if (!value.isObject()) return true;
-    if (value.isMember("protocol") && value["protocol"].isString()) protocol = value["protocol"].asString();
-    if (value.isMember("host") && value["host"].isString()) host = value["host"].asString();
-    if (value.isMember("ip") && value["ip"].isString()) ip = value["ip"].asString();
-    if (value.isMember("port") && value["port"].isInt()) port = value["port"].asInt();
-    if (value.isMember("page") && value["page"].isString()) page = value["page"].asString();
+    JsonTake::TakeAll(value,
+                      {{"protocol", protocol}, {"host", host}, {"ip", ip}, {"port", port}, {"page", page}});
     return true;
 }
 

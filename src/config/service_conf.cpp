@@ -19,6 +19,7 @@
 
 #include "common/log.h"
 #include "common/paths.h"
+#include "config/json_take.h"
 
 namespace ZEPA {
 namespace Relay {
@@ -211,7 +212,7 @@ ServiceConf::ServiceConf(const char* id) : port(-1), ext_port(-1) {
 }
 
 ServiceConf::ServiceConf(const Json::Value& value, bool readConf) : port(-1), ext_port(-1) {
-    if (value.isObject() && value["id"].isString()) id = value["id"].asString();
+    JsonTake::Take(value, "id", id);
     if (readConf) ReadConf(std::string(id));
     Overwrite(value);
 }
@@ -245,10 +246,7 @@ bool ServiceConf::ReadConf(const std::string& serviceId) {
 
 bool ServiceConf::Overwrite(const Json::Value& value) {
     if (!value.isObject()) return true;
-    if (value.isMember("id") && value["id"].isString()) id = value["id"].asString();
-    if (value.isMember("name") && value["name"].isString()) name = value["name"].asString();
-    if (value.isMember("port") && value["port"].isInt()) port = value["port"].asInt();
-    if (value.isMember("ext_port") && value["ext_port"].isInt()) ext_port = value["ext_port"].asInt();
+    JsonTake::TakeAll(value, {{"id", id}, {"name", name}, {"port", port}, {"ext_port", ext_port}});
     return true;
 }
 

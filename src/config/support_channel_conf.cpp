@@ -2,6 +2,8 @@
 
 #include <zeparelayd/config.h>
 
+#include "config/json_take.h"
+
 namespace ZEPA {
 namespace Relay {
 
@@ -10,8 +12,7 @@ SupportChannelConf::SupportChannelConf() : _enabled(false) {}
 SupportChannelConf::~SupportChannelConf() = default;
 
 bool SupportChannelConf::Overwrite(const Json::Value& value) {
-    if (value.isObject() && value.isMember("enabled") && value["enabled"].isBool())
-        _enabled = value["enabled"].asBool();
+    JsonTake::Take(value, "enabled", _enabled);
     return true;
 }
 

@@ -6,6 +6,7 @@
 #include <zeparelayd/config_alias.h>
 
 #include "common/log.h"
+#include "config/json_take.h"
 
 namespace ZEPA {
 namespace Relay {
@@ -18,14 +19,15 @@ const int AliasConf::DEFAULT_POLL_SECONDS;
 namespace {
 
 std::string StringMember(const Json::Value& section, const char* key) {
-    if (section.isObject() && section.isMember(key) && section[key].isString())
-        return section[key].asString();
-    return std::string();
+    std::string out;
+    JsonTake::Take(section, key, out);
+    return out;
 }
 
 int IntMember(const Json::Value& section, const char* key) {
-    if (section.isObject() && section.isMember(key) && section[key].isInt()) return section[key].asInt();
-    return 0;
+    int out = 0;
+    JsonTake::Take(section, key, out);
+    return out;
 }
 
 }  // namespace

@@ -4,6 +4,7 @@
 
 #include "common/log.h"
 #include "common/paths.h"
+#include "config/json_take.h"
 
 namespace ZEPA {
 namespace Relay {
@@ -13,9 +14,7 @@ namespace {
 std::string StatusFile() { return Paths::Resolve(Paths::ALIAS_STATUS_FILE); }
 
 bool StringOf(const Json::Value& doc, const char* key, std::string& out) {
-    if (!doc.isObject() || !doc.isMember(key) || !doc[key].isString()) return false;
-    out = doc[key].asString();
-    return true;
+    return JsonTake::Take(doc, key, out);
 }
 
 }  // namespace

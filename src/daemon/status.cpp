@@ -123,7 +123,8 @@ bool Daemon::GetStatus(std::string& serverId, std::string& state, std::string& e
     int errorNo = IntMember(file, "error", ERROR_NONE);
     if (probe == RELAYD_RESULT_BROKEN) return false;
     // A stale file or a service not relayed both read as "not running".
-    bool relayed = probe == RELAYD_RESULT_OK && (serviceId == nullptr || ListsServiceId(file, serviceId, ServiceIdMatch::AS_STRING));
+    bool relayed = probe == RELAYD_RESULT_OK &&
+                   (serviceId == nullptr || ListsServiceId(file, serviceId, ServiceIdMatch::AS_STRING));
     if (!relayed) {
         stateNo = STATE_NOT_RUNNING;
         errorNo = ERROR_NONE;

@@ -14,8 +14,8 @@ TEST(CurlClass, UnresolvedHostIsResolve) {
 }
 
 TEST(CurlClass, TransportFailuresAreNetwork) {
-    for (CURLcode code : {CURLE_COULDNT_CONNECT, CURLE_OPERATION_TIMEDOUT, CURLE_SSL_CONNECT_ERROR, CURLE_SEND_ERROR,
-                          CURLE_RECV_ERROR, CURLE_AGAIN}) {
+    for (CURLcode code : {CURLE_COULDNT_CONNECT, CURLE_OPERATION_TIMEDOUT, CURLE_SSL_CONNECT_ERROR,
+                          CURLE_SEND_ERROR, CURLE_RECV_ERROR, CURLE_AGAIN}) {
         EXPECT_EQ(CurlFailure::NETWORK, ClassifyCurlCode(code)) << code;
     }
 }
