@@ -13,6 +13,7 @@
 #include <json/writer.h>
 
 #include <zeparelayd/daemon.h>
+#include <zeparelayd/errors.h>
 
 #include "common/log.h"
 #include "common/paths.h"
@@ -25,15 +26,6 @@ namespace zeparelayd {
 
 namespace {
 
-const char* const kSecretKeys[] = {"token", "key", "myhub_password", "relay_pass", "auth_key"};
-
-bool IsSecret(const std::string& key) {
-    for (const char* s : kSecretKeys) {
-        if (key == s) return true;
-    }
-    return false;
-}
-
 // Request bodies carry the device's credentials; the dump shows them masked.
 std::string MaskBody(const std::string& body) {
     Json::Value json;
@@ -44,7 +36,7 @@ std::string MaskBody(const std::string& body) {
         if (!Json::parseFromStream(builder, in, &json, &errors) || !json.isObject()) return "(unreadable)";
         Json::Value& id = json["identity"];
         for (const std::string& k : id.getMemberNames()) {
-            if (IsSecret(k)) id[k] = "***";
+            if (IsSecretKey(k)) id[k] = "***";
         }
         if (id.empty()) json.removeMember("identity");
         Json::StreamWriterBuilder writer;
@@ -55,7 +47,7 @@ std::string MaskBody(const std::string& body) {
     std::string piece, out;
     while (std::getline(in, piece, '&')) {
         const size_t eq = piece.find('=');
-        if (eq != std::string::npos && IsSecret(piece.substr(0, eq))) piece = piece.substr(0, eq + 1) + "***";
+        if (eq != std::string::npos && IsSecretKey(piece.substr(0, eq))) piece = piece.substr(0, eq + 1) + "***";
         out += (out.empty() ? "" : "&") + piece;
     }
     return out;
