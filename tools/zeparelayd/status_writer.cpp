@@ -47,7 +47,8 @@ std::string MaskBody(const std::string& body) {
     std::string piece, out;
     while (std::getline(in, piece, '&')) {
         const size_t eq = piece.find('=');
-        if (eq != std::string::npos && IsSecretKey(piece.substr(0, eq))) piece = piece.substr(0, eq + 1) + "***";
+        if (eq != std::string::npos && IsSecretKey(piece.substr(0, eq)))
+            piece = piece.substr(0, eq + 1) + "***";
         out += (out.empty() ? "" : "&") + piece;
     }
     return out;
