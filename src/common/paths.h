@@ -1,6 +1,11 @@
 // Every fixed absolute path of the library, named once, and resolved against
-// the process-wide system root (zepasdk/sysroot.h). With the root "/" each
-// resolved path is exactly the name below.
+// the process-wide system root. With the root "/" each resolved path is exactly
+// the name below.
+//
+// The root comes from the optional platform hook ZEPASysRootGet (zepasdk/sysroot.h),
+// which the SDK stand-in provides so that tests and demos run in a staging
+// directory. The appliance's own library has no such call: the library refers
+// to it weakly and uses "/" when it is absent.
 #ifndef ZEPARELAYD_SRC_COMMON_PATHS_H
 #define ZEPARELAYD_SRC_COMMON_PATHS_H
 
@@ -22,6 +27,10 @@ constexpr const char ZEPAINFO_DEFAULTS_CONF[] = "/etc.defaults/zepainfo.conf";
 constexpr const char PACKAGES_DIR[] = "/var/packages/";
 constexpr const char PHOTO_SETTINGS_CONF[] = "/var/packages/PictureDock/etc/settings.conf";
 constexpr const char SYNC_SETTING_CONF[] = "/var/packages/SyncDock/etc/setting.conf";
+
+// The router's port-forwarding rules, a file in the folder the platform names
+// (VLIBServiceRouterBasepathGet); the name is the platform's, not resolved.
+constexpr const char ROUTER_PF_RULES_NAME[] = "portforward.conf";
 
 // Runtime state.
 constexpr const char STATUS_FILE[] = "/tmp/.zeparelayd.status";

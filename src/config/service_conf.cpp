@@ -154,7 +154,7 @@ bool ScanRouterRules(int port, std::string& buffer) {
     }
     char base[kTextMax] = {0};
     if (VLIBServiceRouterBasepathGet(base, sizeof(base)) < 0) return false;
-    std::string file = std::string(base) + "/" + ZEPA_ROUTER_PF_RULES_FILE;
+    std::string file = std::string(base) + "/" + Paths::ROUTER_PF_RULES_NAME;
     VLIBCSzList* raw = sections.release();
     int count = VLIBCFileEnumSection(file.c_str(), &raw);
     sections.reset(raw);
