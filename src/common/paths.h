@@ -11,8 +11,6 @@
 
 #include <string>
 
-#include <zeparelayd/export.h>
-
 namespace ZEPA {
 namespace Relay {
 namespace Paths {
@@ -52,7 +50,7 @@ constexpr const char OPENVPN[] = "/usr/sbin/openvpn";
 constexpr const char IPTABLESTOOL[] = "/usr/zepa/bin/iptablestool";
 
 // root + absPath ("/" root: absPath unchanged).
-ZEPARELAYD_API std::string Resolve(const std::string& absPath);
+std::string Resolve(const std::string& absPath);
 
 }  // namespace Paths
 }  // namespace Relay

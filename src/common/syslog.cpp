@@ -6,23 +6,20 @@
 #include <cstdarg>
 #include <cstdio>
 
+#include "common/seams.h"
+
 namespace ZEPA {
 namespace Relay {
-
-namespace {
-SystemLogHook g_hook = nullptr;
-}
-
-void SetSystemLogHook(SystemLogHook hook) { g_hook = hook; }
 
 void SystemLog(int priority, const char* format, ...) {
     int savedErrno = errno;
     va_list args;
     va_start(args, format);
-    if (g_hook) {
+    SystemLogHook hook = GetSystemLogHook();
+    if (hook) {
         char line[2048];
         vsnprintf(line, sizeof(line), format, args);
-        g_hook(priority, line);
+        hook(priority, line);
     } else {
         vsyslog(priority, format, args);
     }

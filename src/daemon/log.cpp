@@ -13,16 +13,13 @@
 
 #include "common/log.h"
 #include "common/paths.h"
-#include "daemon/log_seam.h"
+#include "common/seams.h"
 
 namespace ZEPA {
 namespace Relay {
 
 int Daemon::_logLevel = 4;
 std::string Daemon::_strLogFile;
-
-// Seam for the time-stamp conversion, so that a failing ctime_r can be shown.
-char* (*g_logCtime)(const time_t*, char*) = ctime_r;
 
 namespace {
 

@@ -17,9 +17,9 @@
 
 #include "common/log.h"
 #include "common/paths.h"
+#include "common/seams.h"
 #include "daemon/service_ids.h"
 #include "daemon/status_file.h"
-#include "daemon/status_seam.h"
 
 namespace ZEPA {
 namespace Relay {
@@ -34,8 +34,6 @@ const char NOT_RELAYED[] = "--";
 const unsigned int FIRST_PAUSE_US = 50;
 const unsigned int RETRY_PAUSE_US = 100;
 const int PARSE_ATTEMPTS = 30;
-
-void Usleep(unsigned int usec) { usleep(usec); }
 
 bool ParseStream(std::istream& in, Json::Value& out) {
     Json::Reader reader;
@@ -85,8 +83,6 @@ int ReadDebugDump(const std::string& path, Json::Value& out) {
 }
 
 }  // namespace
-
-void (*g_statusSleep)(unsigned int usec) = Usleep;
 
 int LoadStatusFile(Json::Value& out, pid_t& pid) {
     out = Json::Value();

@@ -10,7 +10,7 @@
 #include "common/log.h"
 #include "common/paths.h"
 #include "tunnel/tunnel_internal.h"
-#include "tunnel/tunnel_seam.h"
+#include "common/seams.h"
 
 namespace ZEPA {
 namespace Relay {

@@ -17,17 +17,13 @@
 
 #include "common/log.h"
 #include "common/paths.h"
+#include "common/seams.h"
 #include "tunnel/tunnel_internal.h"
-#include "tunnel/tunnel_seam.h"
 
 namespace ZEPA {
 namespace Relay {
 
 namespace {
-
-unsigned int g_waitSeconds = 40;
-
-int OpenFile(const char* path, int flags, mode_t mode) { return open(path, flags, mode); }
 
 // Closes on scope exit unless released.
 class FileDescriptor {
@@ -97,7 +93,7 @@ Reaped ReapDeadChildren(pid_t ours) {
 // SIGTERM comes. The death of another child (an earlier VPN child stopped
 // just before, say) is not a reason to stop waiting for this one.
 void WaitForChild(const WaitSignals& signals, pid_t child) {
-    alarm(g_waitSeconds);
+    alarm(GetTunnelWaitSeconds());
     for (;;) {
         signals.Suspend();
         const Reaped reaped = ReapDeadChildren(child);
@@ -122,13 +118,6 @@ bool WriteAll(int fd, const char* data, size_t size) {
 }
 
 }  // namespace
-
-TunnelFileOps g_tunnelFileOps = {OpenFile, fchmod, write};
-int (*g_tunnelShell)(const char* command) = system;
-
-void SetTunnelWaitSeconds(unsigned int seconds) { g_waitSeconds = seconds; }
-
-unsigned int GetTunnelWaitSeconds() { return g_waitSeconds; }
 
 bool Tunnel::RunVPNTunnel(const char* proto) {
     pid = -1;

@@ -11,7 +11,7 @@
 #include <cstdlib>
 
 #include "common/paths.h"
-#include "common/syslog.h"
+#include "support/seams.h"
 
 namespace daemontest {
 

@@ -10,8 +10,8 @@
 #include <zeparelayd/daemon.h>
 #include <zeparelayd/filelock.h>
 
-#include "daemon/status_seam.h"
 #include "daemon_fixture.h"
+#include "support/seams.h"
 
 using ZEPA::Relay::Daemon;
 using namespace daemontest;
@@ -20,10 +20,6 @@ namespace {
 
 class StatusTest : public DaemonTest {
 protected:
-    void TearDown() override {
-        ZEPA::Relay::g_statusSleep = _realSleep;
-        DaemonTest::TearDown();
-    }
     std::string StatusWithPid(pid_t pid, const std::string& extra = "") const {
         return "{\"pid\": " + std::to_string(pid) + extra + "}";
     }
@@ -36,7 +32,7 @@ protected:
     }
 
 private:
-    void (*_realSleep)(unsigned int) = ZEPA::Relay::g_statusSleep;
+    ZEPA::Relay::SeamGuard _seams;
 };
 
 struct Words {

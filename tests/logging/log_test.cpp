@@ -9,7 +9,7 @@
 
 #include <zeparelayd/daemon.h>
 
-#include "daemon/log_seam.h"
+#include "support/seams.h"
 #include "support/test_support.h"
 
 using namespace ZEPA::Relay;

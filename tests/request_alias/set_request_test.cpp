@@ -7,7 +7,7 @@
 #include <utility>
 #include <vector>
 
-#include "common/syslog.h"
+#include "support/seams.h"
 #include "request_alias/identity_fixture.h"
 #include "support/test_support.h"
 

@@ -8,7 +8,7 @@
 #include <cstring>
 #include <sstream>
 
-#include "tunnel/tunnel_seam.h"
+#include "support/seams.h"
 
 using ZEPA::Relay::Tunnel;
 
@@ -85,8 +85,6 @@ void TunnelTest::TearDown() {
     while (waitpid(-1, nullptr, WNOHANG) > 0) {
     }
     alarm(0);
-    ZEPA::Relay::g_tunnelShell = system;
-    ZEPA::Relay::SetTunnelWaitSeconds(40);
     RootTest::TearDown();
 }
 

@@ -11,6 +11,7 @@
 
 #include <zeparelayd/tunnel.h>
 
+#include "support/seams.h"
 #include "support/test_support.h"
 
 namespace tunneltest {
@@ -49,6 +50,8 @@ protected:
     std::string PassPath(const std::string& user = "relayuser") const;
     std::string standin;  // <root>/standin
     std::vector<int> children;
+    // Every seam back to the library's own call after the test.
+    ZEPA::Relay::SeamGuard seams;
 };
 
 std::vector<std::string> SplitLines(const std::string& text);

@@ -11,7 +11,7 @@
 #include <zeparelayd/daemon.h>
 #include <zeparelayd/tunnel.h>
 
-#include "tunnel/tunnel_seam.h"
+#include "support/seams.h"
 #include "tunnel_fixture.h"
 
 using namespace ZEPA::Relay;

@@ -6,7 +6,7 @@
 #include <zeparelayd/daemon.h>
 #include <zeparelayd/tunnel.h>
 
-#include "tunnel/tunnel_seam.h"
+#include "support/seams.h"
 #include "tunnel_fixture.h"
 
 using namespace ZEPA::Relay;
