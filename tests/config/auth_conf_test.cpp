@@ -8,7 +8,7 @@
 #include <zeparelayd/config.h>
 #include <zeparelayd/daemon.h>
 
-#include "fake_platform.h"
+#include "support/fake_sdk/fake_sdk.h"
 #include "support/test_support.h"
 
 using namespace ZEPA::Relay;
@@ -25,6 +25,7 @@ class AuthConfTest : public zepatest::RootTest {
 protected:
     void SetUp() override {
         RootTest::SetUp();
+        zepafake::Reset();
         zepafake::Fake().mac = "02:11:22:33:44:55";
     }
     void WriteIdentity() {

@@ -7,7 +7,7 @@
 #include <zeparelayd/config.h>
 #include <zeparelayd/daemon.h>
 
-#include "fake_platform.h"
+#include "support/fake_sdk/fake_sdk.h"
 #include "support/test_support.h"
 
 using namespace ZEPA::Relay;
@@ -23,6 +23,8 @@ class NetworkConfTest : public zepatest::RootTest {
 protected:
     void SetUp() override {
         RootTest::SetUp();
+        zepafake::Reset();
+        Fake().network = true;
         AddMachineInterface("eth0");
         AddMachineInterface("eth1");
     }

@@ -3,20 +3,32 @@
 
 #include <zeparelayd/config.h>
 
+#include "support/fake_sdk/fake_sdk.h"
 #include "support/service_staging.h"
 #include "support/test_support.h"
 
-// Stands in for the firewall layer's lookup: whatever is asked, a definition
-// whose name is empty.
-extern "C" PZEPAFwService ZEPAFWServiceFind(PZEPAFwService /*pList*/, const char* /*szName*/) {
+namespace {
+
+// A broken firewall layer's lookup: whatever is asked, a definition whose
+// name is empty.
+PZEPAFwService FindUnnamed(PZEPAFwService /*pList*/, const char* /*szName*/) {
     static ZEPAFwService unnamed = {};
     unnamed.dwTcp = 1;
     return &unnamed;
 }
 
-namespace {
-
-class UnnamedDefinitionTest : public zepatest::RootTest {};
+class UnnamedDefinitionTest : public zepatest::RootTest {
+protected:
+    void SetUp() override {
+        RootTest::SetUp();
+        zepafake::Reset();
+        zepafake::Fake().fwServiceFind = FindUnnamed;
+    }
+    void TearDown() override {
+        zepafake::Reset();
+        RootTest::TearDown();
+    }
+};
 
 TEST_F(UnnamedDefinitionTest, DefinitionWithoutNameAborts) {
     GTEST_FLAG_SET(death_test_style, "threadsafe");

@@ -1,12 +1,6 @@
 #include "request_alias/identity_fixture.h"
 
-#include <cstring>
-
-extern "C" int ZEPACloudServiceGetMacAddress(char* buf, int size) {
-    if (buf == nullptr || size < static_cast<int>(sizeof(aliastest::kMac))) return -1;
-    memcpy(buf, aliastest::kMac, sizeof(aliastest::kMac));
-    return 0;
-}
+#include "support/fake_sdk/fake_sdk.h"
 
 namespace aliastest {
 
@@ -18,6 +12,8 @@ void StageIdentity(const zepatest::TempRoot& root, const std::string& serial, co
 
 void IdentityTest::SetUp() {
     zepatest::RootTest::SetUp();
+    zepafake::Reset();
+    zepafake::Fake().mac = kMac;
     StageIdentity(root);
 }
 

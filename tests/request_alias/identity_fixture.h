@@ -1,8 +1,6 @@
 // A test root holding a complete appliance identity: serial and token, API
 // key and model in their key/value files. The MAC address comes from the
-// interface list, which a test cannot set: this executable supplies its own
-// ZEPACloudServiceGetMacAddress (linked with exported symbols, it takes the
-// place of the SDK's for calls from the library).
+// interface list, which a test cannot set: the fake SDK dictates it.
 #ifndef ZEPARELAYD_TESTS_REQUEST_ALIAS_IDENTITY_FIXTURE_H
 #define ZEPARELAYD_TESTS_REQUEST_ALIAS_IDENTITY_FIXTURE_H
 

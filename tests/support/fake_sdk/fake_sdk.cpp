@@ -1,9 +1,11 @@
-#include "fake_platform.h"
+#include "support/fake_sdk/fake_sdk.h"
 
+#include <dlfcn.h>
 #include <zepasdk/identity.h>
 #include <zepasdk/net.h>
 
 #include <cstdio>
+#include <cstdlib>
 #include <cstring>
 
 namespace zepafake {
@@ -13,6 +15,8 @@ Platform& Fake() {
     return platform;
 }
 
+void Reset() { Fake() = Platform(); }
+
 void AddMachineInterface(const std::string& name, std::vector<V6Address> addresses) {
     Fake().machine.push_back(V6Interface{name, std::move(addresses)});
 }
@@ -21,19 +25,39 @@ void AddMachineInterface(const std::string& name, std::vector<V6Address> address
 
 using zepafake::Fake;
 
+namespace {
+
+// The SDK stand-in's own definition of name: the next one after this
+// executable's in the lookup order.
+template <typename Function>
+Function Real(Function, const char* name) {
+    void* symbol = dlsym(RTLD_NEXT, name);
+    if (symbol == nullptr) {
+        fprintf(stderr, "fake SDK: the SDK stand-in has no %s\n", name);
+        abort();
+    }
+    return reinterpret_cast<Function>(symbol);
+}
+
+#define ZEPA_REAL(name) Real(&name, #name)
+
+}  // namespace
+
 extern "C" {
 
 int ZEPACloudServiceGetMacAddress(char* buf, int size) {
     ++Fake().macCalls;
+    if (!Fake().mac && !Fake().macFails) return ZEPA_REAL(ZEPACloudServiceGetMacAddress)(buf, size);
     if (Fake().macFails) {
         VLIBCErrSet(Fake().errorCode);
         return -1;
     }
-    snprintf(buf, size, "%s", Fake().mac.c_str());
+    snprintf(buf, size, "%s", Fake().mac->c_str());
     return 0;
 }
 
 int VLIBNetGetInterfaceInfo(struct VLIBNetIfInfo* list, int max, int selection) {
+    if (!Fake().network) return ZEPA_REAL(VLIBNetGetInterfaceInfo)(list, max, selection);
     Fake().interfaceSelection = selection;
     Fake().interfaceMax = max;
     if (Fake().interfaces.empty()) {
@@ -54,9 +78,13 @@ int VLIBNetGetInterfaceInfo(struct VLIBNetIfInfo* list, int max, int selection) 
     return count;
 }
 
-int ZEPAPPPoECheckStatus(int /*opt*/) { return Fake().pppoeStatus; }
+int ZEPAPPPoECheckStatus(int opt) {
+    if (!Fake().network) return ZEPA_REAL(ZEPAPPPoECheckStatus)(opt);
+    return Fake().pppoeStatus;
+}
 
 int ZEPAPPPoeNetInfoGet(char* ip, int ipSize, char* mask, int maskSize) {
+    if (!Fake().network) return ZEPA_REAL(ZEPAPPPoeNetInfoGet)(ip, ipSize, mask, maskSize);
     ++Fake().pppoeInfoCalls;
     if (Fake().pppoeInfoFails) {
         VLIBCErrSet(Fake().errorCode);
@@ -68,6 +96,7 @@ int ZEPAPPPoeNetInfoGet(char* ip, int ipSize, char* mask, int maskSize) {
 }
 
 int ZEPANetDefaultGatewayGet(char* buf, int size) {
+    if (!Fake().network) return ZEPA_REAL(ZEPANetDefaultGatewayGet)(buf, size);
     if (Fake().gateway.empty()) {
         VLIBCErrSet(Fake().errorCode);
         return -1;
@@ -77,6 +106,7 @@ int ZEPANetDefaultGatewayGet(char* buf, int size) {
 }
 
 int ZEPALnxV6IPGet(const char* ifname, struct ZEPAV6IPInfo* list, int max) {
+    if (!Fake().network) return ZEPA_REAL(ZEPALnxV6IPGet)(ifname, list, max);
     for (const zepafake::V6Interface& itf : Fake().machine) {
         if (itf.name != ifname) continue;
         int count = 0;
@@ -92,6 +122,11 @@ int ZEPALnxV6IPGet(const char* ifname, struct ZEPAV6IPInfo* list, int max) {
     }
     VLIBCErrSet(ZEPA_ERR_NOT_FOUND);
     return -1;
+}
+
+PZEPAFwService ZEPAFWServiceFind(PZEPAFwService pList, const char* szName) {
+    if (Fake().fwServiceFind == nullptr) return ZEPA_REAL(ZEPAFWServiceFind)(pList, szName);
+    return Fake().fwServiceFind(pList, szName);
 }
 
 }  // extern "C"

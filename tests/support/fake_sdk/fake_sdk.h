@@ -1,8 +1,14 @@
-// Machine facts dictated by a test: the definitions in fake_platform.cpp take
-// the place of the SDK's network functions for calls from libzeparelayd.
-#ifndef ZEPARELAYD_TESTS_CONFIG_MACHINE_FAKE_PLATFORM_H
-#define ZEPARELAYD_TESTS_CONFIG_MACHINE_FAKE_PLATFORM_H
+// The fake SDK: machine facts a test dictates because it cannot set them for
+// real (the MAC address, interfaces, addresses, routes, a broken firewall
+// layer). A test executable that links the library zepatest_fake_sdk gets
+// these definitions in place of the SDK's; each answers like the real SDK
+// stand-in (it calls it) until a test dictates its answer through Fake().
+#ifndef ZEPARELAYD_TESTS_SUPPORT_FAKE_SDK_FAKE_SDK_H
+#define ZEPARELAYD_TESTS_SUPPORT_FAKE_SDK_FAKE_SDK_H
 
+#include <zepasdk/fw.h>
+
+#include <optional>
 #include <string>
 #include <vector>
 
@@ -27,10 +33,15 @@ struct V6Interface {
 };
 
 struct Platform {
-    // ZEPACloudServiceGetMacAddress
-    std::string mac = "02:00:00:00:00:01";
+    // ZEPACloudServiceGetMacAddress: the address, or a failure, once dictated
+    // (counted either way).
+    std::optional<std::string> mac;
     bool macFails = false;
     int macCalls = 0;
+    // The network family (VLIBNetGetInterfaceInfo, ZEPAPPPoECheckStatus,
+    // ZEPAPPPoeNetInfoGet, ZEPANetDefaultGatewayGet, ZEPALnxV6IPGet) answers
+    // from the fields below when true, from the machine when false.
+    bool network = false;
     // VLIBNetGetInterfaceInfo: records, or a failure (result -1 / 0)
     std::vector<Interface> interfaces;
     int interfaceResult = 0;  // returned when interfaces is empty (0 or -1)
@@ -47,9 +58,14 @@ struct Platform {
     // ZEPALnxV6IPGet: interfaces that exist, with their addresses
     std::vector<V6Interface> machine;
     int errorCode = 0x0900;
+    // ZEPAFWServiceFind: when set, answers in place of the firewall layer.
+    PZEPAFwService (*fwServiceFind)(PZEPAFwService pList, const char* szName) = nullptr;
 };
 
 Platform& Fake();
+
+// Every function back to the real stand-in's answer.
+void Reset();
 
 // The machine knows name (ZEPALnxV6IPGet answers 0 or more for it).
 void AddMachineInterface(const std::string& name, std::vector<V6Address> addresses = {});
