@@ -1,5 +1,5 @@
-// The relay configuration model: the Config interface, the sections and the
-// aggregate RelaydConf with its JSON file helpers.
+// The relay configuration model: the sections and the aggregate RelaydConf
+// with its JSON file helpers (the Config interface is in config_base.h).
 #ifndef ZEPARELAYD_CONFIG_H
 #define ZEPARELAYD_CONFIG_H
 
@@ -10,33 +10,12 @@
 #include <ostream>
 #include <string>
 
+#include <zeparelayd/config_alias.h>
+#include <zeparelayd/config_base.h>
 #include <zeparelayd/export.h>
 
 // The platform's interface information record (zepasdk/net.h).
 struct VLIBNetIfInfo;
-
-namespace ZEPA {
-namespace Relay {
-
-// A configuration section: filled from JSON, checked, written back.
-// Write(out, false) is the persistent form stored in the file; Write(out, true)
-// the full form that adds volatile, derived or secret fields.
-class ZEPARELAYD_API Config {
-public:
-    virtual bool Overwrite(const Json::Value& value) = 0;
-    virtual bool IsValid() const = 0;
-    virtual bool Write(Json::Value& out, bool full) const = 0;
-    virtual ~Config();
-};
-
-// Prints the full form of any section as one compact JSON line.
-ZEPARELAYD_API std::ostream& operator<<(std::ostream& os, const Config& conf);
-
-}  // namespace Relay
-}  // namespace ZEPA
-
-// AliasConf is held by value in RelaydConf below.
-#include <zeparelayd/config_alias.h>
 
 namespace ZEPA {
 namespace Relay {

@@ -1,16 +1,12 @@
 // The alias section of the relay configuration and the alias status file.
 #ifndef ZEPARELAYD_CONFIG_ALIAS_H
-// Config comes from config.h, which includes this header back once it is defined.
-#include <zeparelayd/config.h>
-#endif
-
-#ifndef ZEPARELAYD_CONFIG_ALIAS_H
 #define ZEPARELAYD_CONFIG_ALIAS_H
 
 #include <json/value.h>
 
 #include <string>
 
+#include <zeparelayd/config_base.h>
 #include <zeparelayd/export.h>
 
 namespace ZEPA {

@@ -1,5 +1,6 @@
 #define ZEPA_LOG_SOURCE "config_alias"
 
+#include <zeparelayd/config.h>
 #include <zeparelayd/config_alias.h>
 
 #include "common/log.h"
