@@ -9,6 +9,7 @@
 #include <zeparelayd/daemon.h>
 
 #include "support/fake_sdk/fake_sdk.h"
+#include "support/round_trip.h"
 #include "support/test_support.h"
 
 using namespace ZEPA::Relay;
@@ -48,6 +49,13 @@ AuthConf Filled() {
                              "\",\"mac\":\"02:11:22:33:44:55\",\"key\":\"" + API_KEY +
                              "\",\"model\":\"ZP-420\"}"));
     return conf;
+}
+
+TEST_F(AuthConfTest, WrittenFormReadsBackEqual) {
+    AuthConf original(false);
+    ASSERT_TRUE(original.Overwrite(ParseJson("{\"serial\":\"ABC123\",\"token\":\"given\"}")));
+    AuthConf fresh(false);
+    EXPECT_TRUE(zepatest::RoundTrips(original, fresh));
 }
 
 }  // namespace

@@ -4,6 +4,7 @@
 
 #include <zeparelayd/config.h>
 
+#include "support/round_trip.h"
 #include "support/test_support.h"
 
 using namespace ZEPA::Relay;
@@ -12,6 +13,21 @@ using zepatest::ParseJson;
 namespace {
 class MyHubConfTest : public zepatest::RootTest {};
 class SupportChannelConfTest : public zepatest::RootTest {};
+TEST_F(MyHubConfTest, WrittenFormReadsBackEqual) {
+    MyHubConf original;
+    ASSERT_TRUE(
+        original.Overwrite(ParseJson("{\"account\":\"me@example.org\",\"host\":\"acct.example.net\"}")));
+    MyHubConf fresh;
+    EXPECT_TRUE(zepatest::RoundTrips(original, fresh));
+}
+
+TEST_F(SupportChannelConfTest, WrittenFormReadsBackEqual) {
+    SupportChannelConf original;
+    ASSERT_TRUE(original.Overwrite(ParseJson("{\"enabled\":true}")));
+    SupportChannelConf fresh;
+    EXPECT_TRUE(zepatest::RoundTrips(original, fresh));
+}
+
 }  // namespace
 
 TEST_F(MyHubConfTest, Defaults) {

@@ -8,6 +8,7 @@
 #include <zeparelayd/daemon.h>
 
 #include "support/fake_sdk/fake_sdk.h"
+#include "support/round_trip.h"
 #include "support/test_support.h"
 
 using namespace ZEPA::Relay;
@@ -47,6 +48,22 @@ Json::Value ScopeEntry(const std::string& address) {
 }
 
 std::string ScopeWord(const std::string& address) { return ScopeEntry(address)["scope"].asString(); }
+
+TEST_F(NetworkConfTest, WrittenFormReadsBackEqual) {
+    NetworkConf original(false);
+    ASSERT_TRUE(original.Overwrite(
+        ParseJson("{\"ddns\":\"d.example\",\"gateway\":\"192.0.2.1\",\"mode\":\"relay\","
+                  "\"interface\":[{\"name\":\"eth0\",\"ip\":\"192.0.2.10\",\"mask\":\"255.255.255.0\"},"
+                  "{\"name\":\"eth1\",\"ip\":\"192.0.2.11\",\"mask\":\"255.255.255.0\"}]}")));
+    NetworkConf fresh(false);
+    EXPECT_TRUE(zepatest::RoundTrips(original, fresh));
+}
+
+TEST_F(InterfaceConfTest, WrittenFormReadsBackEqual) {
+    InterfaceConf original("eth0", "192.0.2.10", "255.255.255.0");
+    InterfaceConf fresh;
+    EXPECT_TRUE(zepatest::RoundTrips(original, fresh));
+}
 
 }  // namespace
 

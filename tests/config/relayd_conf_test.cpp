@@ -7,6 +7,7 @@
 #include <zeparelayd/config.h>
 
 #include "conf_file_fixture.h"
+#include "support/round_trip.h"
 #include "support/service_staging.h"
 #include "support/test_support.h"
 
@@ -461,6 +462,16 @@ TEST_F(RelaydConfTest, AliasRequestDataKeepsKnownIdentity) {
     EXPECT_EQ("KNOWN", out["serial"].asString());
     EXPECT_EQ("tok", out["token"].asString());
     EXPECT_EQ("", out["id"].asString());
+}
+
+TEST_F(RelaydConfTest, WrittenFormReadsBackEqual) {
+    RelaydConf original(conf().c_str());
+    original.serverID = "relay-42";
+    original.serverGlobal.host = "relay.example.net";
+    original.serverWaitCmd.port = 8080;
+    ASSERT_TRUE(original.AddServiceById("nos"));
+    RelaydConf fresh(conf().c_str());
+    EXPECT_TRUE(zepatest::RoundTrips(original, fresh));
 }
 
 }  // namespace

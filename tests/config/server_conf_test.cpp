@@ -4,6 +4,7 @@
 
 #include <zeparelayd/config.h>
 
+#include "support/round_trip.h"
 #include "support/test_support.h"
 
 using namespace ZEPA::Relay;
@@ -14,6 +15,14 @@ namespace {
 class ServerConfTest : public zepatest::RootTest {};
 
 std::vector<std::string> Keys(const Json::Value& v) { return v.getMemberNames(); }
+
+TEST_F(ServerConfTest, WrittenFormReadsBackEqual) {
+    // Only the host is stored; the rest stays at what a reader starts from.
+    ServerConf original(nullptr, nullptr);
+    ASSERT_TRUE(original.Overwrite(ParseJson("{\"host\":\"relay.example.net\"}")));
+    ServerConf fresh(nullptr, nullptr);
+    EXPECT_TRUE(zepatest::RoundTrips(original, fresh));
+}
 
 }  // namespace
 

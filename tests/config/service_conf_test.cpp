@@ -5,6 +5,7 @@
 
 #include <zeparelayd/config.h>
 
+#include "support/round_trip.h"
 #include "support/service_staging.h"
 #include "support/test_support.h"
 
@@ -461,6 +462,14 @@ TEST_F(ServiceConfTest, PrintsFullForm) {
     std::ostringstream os;
     os << s;
     EXPECT_EQ(ParseJson(R"({"id": "nos", "name": "N", "port": 5000})"), ParseJson(os.str()));
+}
+
+TEST_F(ServiceConfTest, WrittenFormReadsBackEqual) {
+    // The id is stored; name and ports come from the machine again when read.
+    ServiceConf original("nos");
+    EXPECT_TRUE(zepatest::RoundTripsVia(original, [](const Json::Value& written) {
+        return std::unique_ptr<ServiceConf>(new ServiceConf(written, true));
+    }));
 }
 
 }  // namespace

@@ -6,6 +6,7 @@
 #include <zeparelayd/config_alias.h>
 #include <zeparelayd/daemon.h>
 
+#include "support/round_trip.h"
 #include "support/test_support.h"
 
 using namespace ZEPA::Relay;
@@ -20,6 +21,14 @@ AliasConf Configured() {
     conf.Overwrite(
         ParseJson("{\"alias\":\"box\",\"url\":\"https://alias.example.net\",\"poll_seconds\":600}"));
     return conf;
+}
+
+TEST_F(AliasConfTest, WrittenFormReadsBackEqual) {
+    AliasConf original;
+    ASSERT_TRUE(original.Overwrite(
+        ParseJson("{\"alias\":\"mybox\",\"poll_seconds\":600,\"url\":\"https://alias.example.net/\"}")));
+    AliasConf fresh;
+    EXPECT_TRUE(zepatest::RoundTrips(original, fresh));
 }
 
 }  // namespace
