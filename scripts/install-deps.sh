@@ -7,7 +7,7 @@ PACKAGES=(
   g++ cmake ninja-build pkg-config make
   libjsoncpp-dev libcurl4-openssl-dev libssl-dev libdaemon-dev libboost-dev
   libgtest-dev libgmock-dev libbenchmark-dev
-  python3 openssl ca-certificates procps iproute2 clang-format
+  python3 openssl ca-certificates procps iproute2 clang-format clang-tidy
 )
 
 missing=()
