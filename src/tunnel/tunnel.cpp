@@ -9,8 +9,8 @@
 
 #include "common/log.h"
 #include "common/paths.h"
-#include "tunnel/tunnel_internal.h"
 #include "common/seams.h"
+#include "tunnel/tunnel_internal.h"
 
 namespace ZEPA {
 namespace Relay {

@@ -7,8 +7,8 @@
 #include <utility>
 #include <vector>
 
-#include "support/seams.h"
 #include "request_alias/identity_fixture.h"
+#include "support/seams.h"
 #include "support/test_support.h"
 
 using namespace ZEPA::Relay;
