@@ -7,9 +7,7 @@
 
 #include <cstdio>
 #include <ctime>
-#include <sstream>
 
-#include <json/reader.h>
 #include <json/writer.h>
 
 #include <zeparelayd/daemon.h>
@@ -22,38 +20,6 @@
 using namespace ZEPA::Relay;
 
 namespace zeparelayd {
-
-namespace {
-
-// Request bodies carry the device's credentials; the dump shows them masked.
-std::string MaskBody(const std::string& body) {
-    Json::Value json;
-    if (!body.empty() && body[0] == '{') {
-        Json::CharReaderBuilder builder;
-        std::istringstream in(body);
-        std::string errors;
-        if (!Json::parseFromStream(builder, in, &json, &errors) || !json.isObject()) return "(unreadable)";
-        Json::Value& id = json["identity"];
-        for (const std::string& k : id.getMemberNames()) {
-            if (IsSecretKey(k)) id[k] = "***";
-        }
-        if (id.empty()) json.removeMember("identity");
-        Json::StreamWriterBuilder writer;
-        writer["indentation"] = "";
-        return Json::writeString(writer, json);
-    }
-    std::stringstream in(body);
-    std::string piece, out;
-    while (std::getline(in, piece, '&')) {
-        const size_t eq = piece.find('=');
-        if (eq != std::string::npos && IsSecretKey(piece.substr(0, eq)))
-            piece = piece.substr(0, eq + 1) + "***";
-        out += (out.empty() ? "" : "&") + piece;
-    }
-    return out;
-}
-
-}  // namespace
 
 void RelayDaemon::SetState(RELAYD_STATE state, RELAYD_RET error) {
     if (state != _state) {
@@ -98,12 +64,13 @@ Json::Value RelayDaemon::DebugDump() const {
     for (const EventLoop::Job& job : _loop.Jobs()) {
         Json::Value one;
         job.request->Write(one);
-        one["data"] = MaskBody(one["data"].asString());
         one["tag"] = job.tag;
         one["running_ms"] = static_cast<Json::Int64>(now - job.startedMs);
         requests.append(one);
     }
-    return dump;
+    // Request descriptions come masked already; the rest of the dump (the
+    // configuration's full form) goes through the same credential list.
+    return MaskSecrets(dump);
 }
 
 void RelayDaemon::RenderDebugDump() {
