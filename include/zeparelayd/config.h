@@ -228,6 +228,10 @@ public:
     std::list<ServiceConf>::const_iterator GetServiceById(const std::string& id) const;
     bool RemoveServiceById(const std::string& id);
     bool CheckServiceRunKey(const SupportService* row) const;
+    // The service list as a JSON array, each element in the form Write(full)
+    // gives; the same array as the "service" member of Write. For programs
+    // that publish or send the list (status file, registration).
+    void WriteServices(Json::Value& out, bool full) const;
 
     bool enable;
     std::string serverID;

@@ -56,6 +56,19 @@ public:
     static int Kill();
     static int Hup();
 
+    // ---- files shared with other processes -----------------------------------
+    // Each is resolved under the system root, so a program started with another
+    // root (a staging tree, a test) finds the same files as the library does.
+    // The relay configuration, "/usr/zepa/etc/zeparelayd/zeparelayd.conf".
+    static std::string GetConfPath();
+    // The status file the daemon writes and the readers below read.
+    static std::string GetStatusPath();
+    // The debug dump that the daemon with this process id writes on SIGUSR1.
+    static std::string GetDebugPath(int pid);
+    // Any absolute appliance path, such as a configured "log_file", under the
+    // system root; empty stays empty.
+    static std::string ResolvePath(const std::string& absPath);
+
     // ---- status readers (report through syslog) ----------------------------
     // 0 running, 1 not running, 255 broken status file.
     static int GetStatus(Json::Value& out);

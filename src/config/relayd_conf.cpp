@@ -116,6 +116,15 @@ bool RelaydConf::IsValid() const {
     return true;
 }
 
+void RelaydConf::WriteServices(Json::Value& out, bool full) const {
+    out = Json::Value(Json::arrayValue);
+    for (const ServiceConf& service : services) {
+        Json::Value element;
+        service.Write(element, full);
+        out.append(element);
+    }
+}
+
 bool RelaydConf::Write(Json::Value& out, bool full) const {
     serverGlobal.Write(out["server_global"], full);
     serverControl.Write(out["server_control"], full);
@@ -125,12 +134,7 @@ bool RelaydConf::Write(Json::Value& out, bool full) const {
     myhub.Write(out["server_myhub"], true);
     supportChannel.Write(out["support_channel"], true);
     if (!serverID.empty()) out["serverID"] = serverID;
-    Json::Value& list = out["service"] = Json::Value(Json::arrayValue);
-    for (const ServiceConf& service : services) {
-        Json::Value element;
-        service.Write(element, full);
-        list.append(element);
-    }
+    WriteServices(out["service"], full);
     out["log_level"] = logLevel;
     out["log_file"] = logFile;
     if (!full) return true;

@@ -40,12 +40,6 @@ bool ParseStream(std::istream& in, Json::Value& out) {
     return reader.parse(in, out, true);
 }
 
-std::string DebugFilePath(pid_t pid) {
-    char name[1024];
-    snprintf(name, sizeof(name), Paths::DEBUG_FILE_FORMAT, static_cast<int>(pid));
-    return Paths::Resolve(name);
-}
-
 int IntMember(const Json::Value& value, const char* key, int fallback) {
     if (!value.isObject() || !value.isMember(key) || !value[key].isInt()) return fallback;
     return value[key].asInt();
@@ -136,7 +130,7 @@ int Daemon::DebugStatus(Json::Value& out) {
     out = Json::Value();
     pid_t pid = daemon_pid_file_is_running();
     if (pid < 0) return RELAYD_RESULT_NOT_RUNNING;
-    const std::string path = DebugFilePath(pid);
+    const std::string path = Daemon::GetDebugPath(pid);
     FileLock lock(path.c_str());
     if (!lock.Lock(LOCK_EX)) {
         ZSYSLOG(LOG_INFO, "lock failed");

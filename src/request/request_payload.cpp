@@ -4,6 +4,9 @@
 
 #include <json/reader.h>
 #include <json/writer.h>
+
+#include <exception>
+
 #include <zeparelayd/errors.h>
 #include <zeparelayd/request.h>
 
@@ -22,7 +25,14 @@ std::string Serialise(const Json::Value& data) {
 bool Parse(const std::string& text, Json::Value& out) {
     Json::Reader reader;
     Json::Value parsed;
-    if (reader.parse(text, parsed, false)) {
+    bool ok = false;
+    try {
+        ok = reader.parse(text, parsed, false);
+    } catch (const std::exception&) {
+        // The reader throws past its nesting limit: an unreadable answer like any other.
+        ok = false;
+    }
+    if (ok) {
         out.swap(parsed);
         return true;
     }

@@ -1,8 +1,9 @@
 #!/usr/bin/env bash
-# usage: check_install.sh BUILD_DIR CONSUMER_SOURCE_DIR
+# usage: check_install.sh BUILD_DIR CONSUMER_SOURCE_DIR TOOLS_SOURCE_DIR
 set -euo pipefail
 build=$1
 src=$2
+tools=$3
 work=$(mktemp -d /tmp/zepa-install.XXXXXX)
 trap 'rm -rf "$work"' EXIT
 
@@ -27,6 +28,22 @@ pkg-config --exists zeparelayd || { echo "pkg-config does not find zeparelayd" >
 LD_LIBRARY_PATH="$libdir" g++ -std=c++17 "$src/consumer.cpp" -o "$work/consumer-pc" $(pkg-config --cflags --libs zeparelayd)
 LD_LIBRARY_PATH="$libdir" "$work/consumer-pc" > "$work/out2"
 cmp "$work/out1" "$work/out2"
+
+echo "== the daemon and the control tool built on their own against the installed library"
+cmake -S "$tools" -B "$work/tools-build" -G Ninja -DCMAKE_PREFIX_PATH="$work/prefix" \
+  -DCMAKE_CXX_FLAGS="-Wall -Wextra -Werror" >/dev/null
+cmake --build "$work/tools-build" >/dev/null || {
+  echo "tools/ does not build against the installed library: run 'cmake --build $work/tools-build' to see why" >&2
+  exit 1
+}
+mkdir -p "$work/root"
+LD_LIBRARY_PATH="$libdir" "$work/tools-build/zeparelayd/zeparelayd" --version > "$work/out3"
+grep -qx "zeparelayd [0-9.]*" "$work/out3" || { cat "$work/out3"; exit 1; }
+status=0
+LD_LIBRARY_PATH="$libdir" "$work/tools-build/zeparelayctl/zeparelayctl" --root "$work/root" status > "$work/out4" || status=$?
+[ "$status" = 1 ] && grep -qx "state: not_running" "$work/out4" || {
+  echo "installed-consumer zeparelayctl status gave $status:" >&2; cat "$work/out4" >&2; exit 1
+}
 
 echo "== only the public interface is exported"
 if nm -D --defined-only "$libdir/libzeparelayd.so" | grep -q 'ParseKvLine\|g_hook'; then

@@ -155,6 +155,8 @@ protected:
 
     int Requests(const std::string& path) { return static_cast<int>(server.requests(path).size()); }
 
+    void SignalAsThePidFileAppears(int sig, int rounds);
+
     int Notices() {
         if (!root.exists("/var/log/zepanosnotify.log")) return 0;
         std::string text = root.read("/var/log/zepanosnotify.log");
@@ -333,6 +335,127 @@ TEST_F(DaemonProcess, StopsCleanly) {
     EXPECT_EQ(pid, file["pid"].asInt());
     EXPECT_EQ(1, Ctl({"status"}));
     EXPECT_EQ(1, Ctl({"stop"}));
+}
+
+// Tools signal the daemon as soon as its PID file appears ("reload",
+// "enable" and "disable" send SIGHUP, "status --debug" SIGUSR1); none of
+// those signals may kill it, however early it comes.
+void DaemonProcess::SignalAsThePidFileAppears(int sig, int rounds) {
+    const std::string pidFile = root.path("/var/run/zeparelayd.pid");
+    for (int round = 0; round < rounds; ++round) {
+        pid_t starter = fork();
+        if (starter == 0) {
+            execl(kDaemon.c_str(), kDaemon.c_str(), "--root", root.dir().c_str(), "--ca-file",
+                  server.caFile().c_str(), static_cast<char*>(nullptr));
+            _exit(127);
+        }
+        ASSERT_GT(starter, 0);
+        // No pause between looks: the window right after the file appears is
+        // the one that matters.
+        pid_t pid = -1;
+        const auto end = std::chrono::steady_clock::now() + std::chrono::seconds(15);
+        while (pid <= 0 && std::chrono::steady_clock::now() < end) {
+            const int fd = open(pidFile.c_str(), O_RDONLY | O_CLOEXEC);
+            if (fd < 0) continue;
+            char buf[32] = {0};
+            const ssize_t n = read(fd, buf, sizeof(buf) - 1);
+            close(fd);
+            if (n > 0) pid = atoi(buf);
+        }
+        ASSERT_GT(pid, 0) << "round " << round << ": no PID file";
+        ASSERT_EQ(0, kill(pid, sig)) << "round " << round;
+        int status = 0;
+        ASSERT_EQ(starter, waitpid(starter, &status, 0));
+        EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << "round " << round << ": " << status;
+        ASSERT_TRUE(Alive(pid)) << "round " << round << ": signal " << sig << " killed the daemon";
+        ASSERT_TRUE(WaitUntil([&] { return Ctl({"status"}) == 0; })) << "round " << round;
+        kill(pid, SIGTERM);
+        ASSERT_TRUE(WaitUntil([&] { return !Alive(pid) && !root.exists("/var/run/zeparelayd.pid"); }))
+            << "round " << round;
+    }
+}
+
+TEST_F(DaemonProcess, HangupAsThePidFileAppearsNeverKills) { SignalAsThePidFileAppears(SIGHUP, 20); }
+
+TEST_F(DaemonProcess, DebugQueryAsThePidFileAppearsNeverKills) { SignalAsThePidFileAppears(SIGUSR1, 10); }
+
+// Registration answers of a broken or hostile control server: each is an
+// answer without what the daemon looks for, and it carries on.
+TEST_F(DaemonProcess, MisshapenRegistrationAnswersDoNotKillTheDaemon) {
+    const std::string deep = std::string(1000, '[') + std::string(1000, ']');
+    const std::string deeper = std::string(100000, '[') + std::string(100000, ']');
+    const std::string deepObject = [] {
+        std::string text;
+        for (int i = 0; i < 1000; ++i) text += "{\"serverID\":";
+        text += "0";
+        for (int i = 0; i < 1000; ++i) text += "}";
+        return text;
+    }();
+    const std::vector<std::string> answers = {R"([{"errno":0}])",
+                                              R"([{"errno":0.}])",
+                                              R"([{"errno":00}])",
+                                              R"({"errno":0,"serverID":["x"]})",
+                                              deep,
+                                              deeper,
+                                              deepObject};
+    bool started = false;
+    pid_t pid = -1;
+    for (size_t i = 0; i < answers.size(); ++i) {
+        SCOPED_TRACE("answer " + std::to_string(i));
+        ASSERT_TRUE(server.script("/Serv.php", 200, answers[i]));
+        const int before = Requests("/Serv.php");
+        if (!started) {
+            ASSERT_EQ(0, StartDaemon());
+            pid = DaemonPid();
+            started = true;
+        } else {
+            ASSERT_EQ(0, Ctl({"reload"}));
+        }
+        // Handled: the server has answered and the daemon no longer waits for it.
+        ASSERT_TRUE(WaitUntil([&] {
+            if (Requests("/Serv.php") != before + 1) return false;
+            for (const Json::Value& job : Dump()["requests"]) {
+                if (job["tag"].asString() == "register") return false;
+            }
+            return true;
+        }));
+        // It took the answer for a success without a server id, or for an
+        // unreadable one to be retried.
+        const std::string status = CtlStatus();
+        EXPECT_TRUE(status.find("state: connected") != std::string::npos ||
+                    status.find("error: err_unknown") != std::string::npos)
+            << status;
+        ASSERT_TRUE(Alive(pid));
+        EXPECT_EQ(pid, StatusFile()["pid"].asInt());
+        EXPECT_EQ(0, Ctl({"status"}));
+    }
+}
+
+// A control server that keeps sending the daemon to a new host: the first
+// move is followed at once, the next ones wait like failed attempts.
+TEST_F(DaemonProcess, AControlServerThatKeepsMovingIsFollowedWithBackoff) {
+    Json::Value plan;
+    plan["path"] = "/Serv.php";
+    plan["json"]["errno"] = 13;
+    plan["json"]["control_host"] = "127.0.0.1";
+    plan["count"] = 1000;
+    ASSERT_TRUE(server.scriptRaw(plan));
+    ASSERT_EQ(0, StartDaemon());
+    ASSERT_TRUE(StatusHas("error: err_server_changed"));
+    Json::Value reg;
+    ASSERT_TRUE(WaitUntil([&] {
+        reg = Dump()["registration"];
+        return reg["moves"].asInt() == 2;
+    }));
+    EXPECT_GE(reg["retry_in_ms"].asInt64(), 20000);
+    EXPECT_EQ(2, Requests("/Serv.php"));
+    EXPECT_TRUE(Alive(DaemonPid()));
+
+    // A reload starts afresh: the next move is followed at once again.
+    EXPECT_EQ(0, Ctl({"reload"}));
+    ASSERT_TRUE(WaitUntil([&] { return Requests("/Serv.php") == 4; }));
+    ASSERT_TRUE(WaitUntil([&] { return Dump()["registration"]["moves"].asInt() == 2; }));
+    EXPECT_EQ(4, Requests("/Serv.php"));
 }
 
 }  // namespace

@@ -9,15 +9,13 @@
 #include <zeparelayd/config.h>
 #include <zeparelayd/daemon.h>
 
-#include "common/paths.h"
-
 using namespace ZEPA::Relay;
 
 namespace zeparelayctl {
 
 namespace {
 
-std::string ConfPath() { return Paths::Resolve(Paths::RELAYD_CONF); }
+std::string ConfPath() { return Daemon::GetConfPath(); }
 
 void SleepMs(long ms) {
     timespec ts{ms / 1000, (ms % 1000) * 1000000L};

@@ -1,25 +1,12 @@
-// Keeping the alias registered. Schedule:
-//   - after each (re)registration the alias is mapped at once; after a
-//     success the next keep-alive goes out after AliasConf::GetPollingTime()
-//     (poll seconds plus a random share of them);
-//   - retry class "normal" (server busy, network, unknown answers...): back
-//     off 60 s doubling per failure, at most the poll period, plus up to half
-//     of it again as jitter, so that many appliances do not retry in step;
-//     "alias not found" maps again instead of keeping alive;
-//   - retry class "resolve": forget the DNS cache and retry after 20-30 s;
-//   - retry class "stop" (bad auth, bad IP, alias in use): no automatic retry
-//     until the configuration is reloaded; an explicit update request still
-//     runs, since someone asked for it.
-// The outcome is recorded in the alias status file after every exchange.
-#define ZEPA_LOG_SOURCE "alias_cycle"
+#define RLOG_SOURCE "alias_cycle"
+
+#include "alias_cycle.h"
 
 #include <zeparelayd/config_alias.h>
 
-#include <algorithm>
 #include <cstdlib>
 
-#include "common/log.h"
-#include "relay_daemon.h"
+#include "log.h"
 
 using namespace ZEPA::Relay;
 
@@ -27,16 +14,10 @@ namespace zeparelayd {
 
 namespace {
 
+const char TAG[] = "alias";
+
 const char* CommandWord(ALIAS_REQUEST_CMD cmd) {
     return cmd == ALIAS_REQ_MAP ? "map" : cmd == ALIAS_REQ_KEEP_ALIVE ? "keep_alive" : "other";
-}
-
-int64_t NormalBackoffMs(int failures, int pollSeconds) {
-    int64_t cap = static_cast<int64_t>(std::max(pollSeconds, 60)) * 1000;
-    int64_t delay = 60000;
-    for (int i = 1; i < failures && delay < cap; ++i) delay *= 2;
-    delay = std::min(delay, cap);
-    return delay + random() % (delay / 2 + 1);
 }
 
 // The word shown for an outcome: the server's own word when it answered with
@@ -54,95 +35,97 @@ std::string OutcomeWord(bool answered, ALIAS_RET ret, const Request& req) {
 
 }  // namespace
 
-void RelayDaemon::ScheduleAlias(ALIAS_REQUEST_CMD cmd, int64_t delayMs, const char* why) {
-    _aliasNextCmd = CommandWord(cmd);
-    ZLOG(ZEPA_LOG_DEBUG, "alias %s in %lld ms (%s)", _aliasNextCmd.c_str(), static_cast<long long>(delayMs),
-         why);
-    _loop.SetTimer("alias", delayMs, [this, cmd] { RunAlias(cmd); });
-}
+AliasCycle::AliasCycle(RelaydConf& conf, EventLoop& loop, const Clock& clock, Hooks hooks)
+    : _conf(conf), _loop(loop), _policy(clock, [] { return random(); }), _hooks(std::move(hooks)) {}
 
-void RelayDaemon::StopAliasCycle() {
-    _loop.CancelTimer("alias");
-    _loop.CancelRequests("alias");
-    _aliasNextCmd.clear();
-}
-
-void RelayDaemon::RunAlias(ALIAS_REQUEST_CMD cmd) {
-    _aliasNextCmd.clear();
-    if (_state != RELAYD_STATE_CONNECTED) {
-        ZLOG(ZEPA_LOG_INFO, "alias %s skipped: not registered", CommandWord(cmd));
+void AliasCycle::Follow(const AliasStep& step, const char* why) {
+    _loop.CancelTimer(TAG);
+    _next.clear();
+    if (!step.run) {
+        RLOG(LOG_WARNING, "alias refused (%s): waiting for a reload", _word.c_str());
         return;
     }
-    if (!_conf->alias.IsAliasEnabled()) {
-        ZLOG(ZEPA_LOG_DEBUG, "no alias configured");
+    if (step.cleanDns) Request::CleanDnsCache();
+    const ALIAS_REQUEST_CMD cmd = step.cmd;
+    _next = CommandWord(cmd);
+    RLOG(LOG_DEBUG, "alias %s in %lld ms (%s)", _next.c_str(), static_cast<long long>(step.delayMs), why);
+    _loop.SetTimer(TAG, step.delayMs, [this, cmd] { Run(cmd); });
+}
+
+void AliasCycle::OnRegistered() {
+    if (!_policy.Halted()) Follow(_policy.OnRegistered(), "registered");
+}
+
+void AliasCycle::OnRequested() {
+    RLOG(LOG_INFO, "alias update requested");
+    Follow(_policy.OnRequested(), "requested");
+}
+
+void AliasCycle::Stop() {
+    _loop.CancelTimer(TAG);
+    _loop.CancelRequests(TAG);
+    _policy.OnAttempt();
+    _next.clear();
+}
+
+void AliasCycle::Reset() {
+    Stop();
+    _policy.Reset();
+}
+
+void AliasCycle::Run(ALIAS_REQUEST_CMD cmd) {
+    _next.clear();
+    _policy.OnAttempt();
+    if (_hooks.registered && !_hooks.registered()) {
+        RLOG(LOG_INFO, "alias %s skipped: not registered", CommandWord(cmd));
         return;
     }
-    _loop.CancelRequests("alias");
+    if (!_conf.alias.IsAliasEnabled()) {
+        RLOG(LOG_DEBUG, "no alias configured");
+        return;
+    }
+    _loop.CancelRequests(TAG);
     Json::Value data;
-    _conf->DumpDataForAliasReq(data);
+    _conf.DumpDataForAliasReq(data);
     AliasRequest builder;
     std::string body, url;
     if (!builder.SetRequest(cmd, data) || !builder.GetRequest(body, url)) {
-        // Missing identity or alias data: nothing a retry would change.
-        _aliasHalted = true;
-        RecordAliasStatus("error_bad_param", "incomplete alias data");
+        _policy.OnIncompleteData();
+        Record("error_bad_param", "incomplete alias data");
         return;
     }
     boost::shared_ptr<Request> req(new Request(url.c_str(), body.c_str(), true));
-    ZLOG(ZEPA_LOG_INFO, "alias %s [%s]", CommandWord(cmd), _conf->alias.GetAliasName().c_str());
-    if (!_loop.StartRequest("alias", req,
-                            [this, cmd](boost::shared_ptr<Request> r) { OnAliasDone(cmd, r); })) {
-        RecordAliasStatus("error_unknown", "request not started");
-        ++_aliasFailures;
-        ScheduleAlias(cmd, NormalBackoffMs(_aliasFailures, _conf->alias.GetPollSeconds()), "not started");
+    RLOG(LOG_INFO, "alias %s [%s]", CommandWord(cmd), _conf.alias.GetAliasName().c_str());
+    if (!_loop.StartRequest(TAG, req, [this, cmd](boost::shared_ptr<Request> r) { OnDone(cmd, r); })) {
+        Record("error_unknown", "request not started");
+        Follow(_policy.OnNotStarted(cmd, _conf.alias.GetPollSeconds()), "not started");
     }
 }
 
-void RelayDaemon::OnAliasDone(ALIAS_REQUEST_CMD cmd, boost::shared_ptr<Request> req) {
+void AliasCycle::OnDone(ALIAS_REQUEST_CMD cmd, boost::shared_ptr<Request> req) {
     ALIAS_RET ret = ALIAS_RET_UNKNOWN;
     std::string detail;
     const bool answered = AliasRequest::GetResponseForDaemon(req, ret, detail);
-    RecordAliasStatus(OutcomeWord(answered, ret, *req), detail);
-    ALIAS_RETRY_TYPE type = ALIAS_RETRY_NORMAL;
-    AliasRequest::GetRetryType(ret, type);
-    _aliasRetryClass = type;
-    const int poll = _conf->alias.GetPollSeconds();
-
-    if (ret == ALIAS_RET_SUCCESS) {
-        _aliasFailures = 0;
-        _aliasMapped = true;
-        ScheduleAlias(ALIAS_REQ_KEEP_ALIVE, static_cast<int64_t>(_conf->alias.GetPollingTime()) * 1000,
-                      "success");
-        return;
-    }
-    ++_aliasFailures;
-    switch (type) {
-        case ALIAS_RETRY_STOP:
-            _aliasHalted = true;
-            _loop.CancelTimer("alias");
-            ZLOG(ZEPA_LOG_WARNING, "alias %s refused (%s): waiting for a reload", CommandWord(cmd),
-                 _aliasWord.c_str());
-            break;
-        case ALIAS_RETRY_RESOLVE:
-            Request::CleanDnsCache();
-            ScheduleAlias(cmd, 20000 + random() % 10000, "resolve failure");
-            break;
-        default:
-            if (ret == ALIAS_RET_NOT_FOUND) {
-                _aliasMapped = false;
-                cmd = ALIAS_REQ_MAP;
-            }
-            ScheduleAlias(cmd, NormalBackoffMs(_aliasFailures, poll), "failure");
-            break;
-    }
+    Record(OutcomeWord(answered, ret, *req), detail);
+    const int polling = ret == ALIAS_RET_SUCCESS ? _conf.alias.GetPollingTime() : 0;
+    Follow(_policy.OnOutcome(cmd, ret, _conf.alias.GetPollSeconds(), polling),
+           ret == ALIAS_RET_SUCCESS ? "success" : "failure");
 }
 
-void RelayDaemon::RecordAliasStatus(const std::string& word, const std::string& extra) {
-    _aliasWord = word;
-    _aliasExtra = extra;
+void AliasCycle::Record(const std::string& word, const std::string& extra) {
+    _word = word;
+    _extra = extra;
     AliasStatus status;
-    status.SetStatus(_conf->alias.GetAliasName(), word, extra, true);
-    WriteStatus();
+    status.SetStatus(_conf.alias.GetAliasName(), word, extra, true);
+    if (_hooks.changed) _hooks.changed();
+}
+
+void AliasCycle::Dump(Json::Value& out) const {
+    out["name"] = _conf.alias.GetAliasName();
+    out["status"] = _word;
+    out["extra"] = _extra;
+    out["next"] = _next;
+    _policy.Dump(out);
 }
 
 }  // namespace zeparelayd

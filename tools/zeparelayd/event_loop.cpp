@@ -1,29 +1,23 @@
-#define ZEPA_LOG_SOURCE "loop"
+#define RLOG_SOURCE "loop"
 
 #include "event_loop.h"
 
 #include <libdaemon/dsignal.h>
 #include <poll.h>
-#include <time.h>
 
 #include <algorithm>
 #include <cerrno>
 #include <climits>
 #include <vector>
 
-#include "common/log.h"
+#include "log.h"
 
 using ZEPA::Relay::Request;
 
 namespace zeparelayd {
 
-int64_t NowMs() {
-    timespec ts{};
-    clock_gettime(CLOCK_MONOTONIC, &ts);
-    return static_cast<int64_t>(ts.tv_sec) * 1000 + ts.tv_nsec / 1000000;
-}
-
-EventLoop::EventLoop() : _multi(curl_multi_init()), _curlDueMs(-1), _running(false) {
+EventLoop::EventLoop(const Clock& clock)
+    : _clock(clock), _multi(curl_multi_init()), _curlDueMs(-1), _running(false) {
     if (_multi == nullptr) return;
     curl_multi_setopt(_multi, CURLMOPT_SOCKETFUNCTION, &EventLoop::SocketCallback);
     curl_multi_setopt(_multi, CURLMOPT_SOCKETDATA, this);
@@ -49,12 +43,12 @@ int EventLoop::SocketCallback(CURL*, curl_socket_t fd, int what, void* userp, vo
 
 int EventLoop::TimerCallback(CURLM*, long timeoutMs, void* userp) {
     auto* self = static_cast<EventLoop*>(userp);
-    self->_curlDueMs = timeoutMs < 0 ? -1 : NowMs() + timeoutMs;
+    self->_curlDueMs = timeoutMs < 0 ? -1 : self->_clock.NowMs() + timeoutMs;
     return 0;
 }
 
 void EventLoop::SetTimer(const std::string& name, int64_t delayMs, TimerHandler handler) {
-    _timers[name] = Timer{NowMs() + std::max<int64_t>(delayMs, 0), std::move(handler)};
+    _timers[name] = Timer{_clock.NowMs() + std::max<int64_t>(delayMs, 0), std::move(handler)};
 }
 
 void EventLoop::CancelTimer(const std::string& name) { _timers.erase(name); }
@@ -62,13 +56,13 @@ void EventLoop::CancelTimer(const std::string& name) { _timers.erase(name); }
 int64_t EventLoop::TimerRemaining(const std::string& name) const {
     auto it = _timers.find(name);
     if (it == _timers.end()) return -1;
-    return std::max<int64_t>(it->second.dueMs - NowMs(), 0);
+    return std::max<int64_t>(it->second.dueMs - _clock.NowMs(), 0);
 }
 
 bool EventLoop::StartRequest(const std::string& tag, boost::shared_ptr<Request> request,
                              RequestHandler handler) {
     if (!request || !request->JobAdd(_multi)) return false;
-    _jobs.push_back(Job{tag, request, std::move(handler), NowMs()});
+    _jobs.push_back(Job{tag, request, std::move(handler), _clock.NowMs()});
     // JobAdd kicked the transfer; it may already have finished (refused at once).
     CollectFinished();
     return true;
@@ -95,7 +89,7 @@ int EventLoop::PollTimeout() const {
         if (due < 0 || t.second.dueMs < due) due = t.second.dueMs;
     }
     if (due < 0) return -1;
-    int64_t wait = due - NowMs();
+    int64_t wait = due - _clock.NowMs();
     if (wait <= 0) return 0;
     return static_cast<int>(std::min<int64_t>(wait, INT_MAX));
 }
@@ -114,7 +108,7 @@ bool EventLoop::Run() {
         }
         int n = poll(fds.data(), fds.size(), PollTimeout());
         if (n < 0 && errno != EINTR) {
-            ZLOG(ZEPA_LOG_ERR, "poll failed (%d)", errno);
+            RLOG(LOG_ERR, "poll failed (%d)", errno);
             return false;
         }
         if (n > 0 && (fds[0].revents & POLLIN)) DrainSignals();
@@ -126,7 +120,7 @@ bool EventLoop::Run() {
             if (fds[i].revents & (POLLERR | POLLHUP | POLLNVAL)) mask |= CURL_CSELECT_ERR;
             SocketAction(fds[i].fd, mask);
         }
-        if (_running && _curlDueMs >= 0 && _curlDueMs <= NowMs()) {
+        if (_running && _curlDueMs >= 0 && _curlDueMs <= _clock.NowMs()) {
             _curlDueMs = -1;
             SocketAction(CURL_SOCKET_TIMEOUT, 0);
         }
@@ -167,7 +161,7 @@ void EventLoop::CollectFinished() {
 }
 
 void EventLoop::RunDueTimers() {
-    int64_t now = NowMs();
+    int64_t now = _clock.NowMs();
     std::vector<std::string> due;
     for (const auto& t : _timers) {
         if (t.second.dueMs <= now) due.push_back(t.first);

@@ -15,10 +15,9 @@
 
 #include <zeparelayd/request.h>
 
-namespace zeparelayd {
+#include "clock.h"
 
-// Milliseconds of the monotonic clock.
-int64_t NowMs();
+namespace zeparelayd {
 
 class EventLoop {
 public:
@@ -26,7 +25,7 @@ public:
     using TimerHandler = std::function<void()>;
     using RequestHandler = std::function<void(boost::shared_ptr<ZEPA::Relay::Request>)>;
 
-    EventLoop();
+    explicit EventLoop(const Clock& clock);
     ~EventLoop();
     EventLoop(const EventLoop&) = delete;
     EventLoop& operator=(const EventLoop&) = delete;
@@ -78,6 +77,7 @@ private:
     void CollectFinished();
     void RunDueTimers();
 
+    const Clock& _clock;
     CURLM* _multi;
     std::map<curl_socket_t, int> _sockets;  // fd -> CURL_POLL_* wish
     int64_t _curlDueMs;                     // -1: curl wants no timeout

@@ -4,12 +4,13 @@
 // 0 started, 4 PID file not created, 255 no word) or stopped cleanly;
 // 1 a daemon already runs on the PID file; 2 bad usage; 3 the event loop
 // could not be set up.
-#define ZEPA_LOG_SOURCE "zeparelayd"
+#define RLOG_SOURCE "zeparelayd"
 
 #include <curl/curl.h>
 #include <libdaemon/dpid.h>
 #include <libdaemon/dsignal.h>
 #include <limits.h>
+#include <signal.h>
 #include <stdlib.h>
 
 #include <cstdio>
@@ -21,9 +22,9 @@
 #include <zeparelayd/request.h>
 #include <zepasdk/sysroot.h>
 
-#include "common/log.h"
-#include "common/paths.h"
+#include "clock.h"
 #include "event_loop.h"
+#include "log.h"
 #include "relay_daemon.h"
 
 using namespace ZEPA::Relay;
@@ -102,33 +103,51 @@ int main(int argc, char** argv) {
     if (!opt.caFile.empty()) Request::SetExtraCaFile(opt.caFile);
 
     Daemon::SetName(argv[0]);
-    const std::string confPath = Paths::Resolve(Paths::RELAYD_CONF);
+    const std::string confPath = Daemon::GetConfPath();
     {
         // Log settings before forking, so that the child's standard error
         // points at the configured file from its first line on.
         RelaydConf early(confPath.c_str());
-        Daemon::SetLogFile(early.logFile.empty() ? std::string() : Paths::Resolve(early.logFile),
-                           early.logLevel);
+        zeparelayd::ApplyLogSettings(early);
+    }
+    // Tools signal the daemon as soon as its PID file exists. So the signals
+    // are held back from before the PID file is written, and their handlers
+    // (inherited across the fork) exist by then too; they are let through
+    // once the loop can answer them.
+    sigset_t held;
+    sigemptyset(&held);
+    for (int sig : {SIGINT, SIGTERM, SIGQUIT, SIGPIPE, SIGHUP, SIGCHLD, SIGALRM, SIGUSR1, SIGUSR2,
+                    SIGRTMIN + 1, SIGRTMIN + 5}) {
+        sigaddset(&held, sig);
+    }
+    sigset_t previous;
+    sigprocmask(SIG_BLOCK, &held, &previous);
+    if (Daemon::InitSignalHandler() < 0) {
+        fprintf(stderr, "zeparelayd: cannot install the signal handlers\n");
+        return 3;
     }
     if (!Daemon::Init(!opt.foreground)) return 1;
 
     curl_global_init(CURL_GLOBAL_DEFAULT);
     int status = 0;
     {
-        zeparelayd::EventLoop loop;
-        zeparelayd::RelayDaemon relay(confPath, loop);
+        zeparelayd::MonotonicClock clock;
+        zeparelayd::EventLoop loop(clock);
+        zeparelayd::RelayDaemon relay(confPath, loop, clock);
         relay.ApplyLogSettings();
-        if (!loop.IsReady() || Daemon::InitSignalHandler() < 0) {
-            ZLOG(ZEPA_LOG_ERR, "cannot set up the event loop");
+        if (!loop.IsReady()) {
+            RLOG(LOG_ERR, "cannot set up the event loop");
             status = 3;
         } else {
             loop.OnSignal([&relay](int sig) { relay.HandleSignal(sig); });
             loop.OnIdle([&relay] { relay.Idle(); });
-            if (!relay.Start() || !loop.Run()) status = 3;
+            const bool started = relay.Start();
+            sigprocmask(SIG_SETMASK, &previous, nullptr);
+            if (!started || !loop.Run()) status = 3;
             relay.Shutdown();
-            daemon_signal_done();
         }
     }
+    daemon_signal_done();
     daemon_pid_file_remove();
     curl_global_cleanup();
     return status;

@@ -1,22 +1,27 @@
-// The relay daemon proper: configuration, registration with the control
-// server, the alias cycle and the files it publishes, all driven by one
-// EventLoop.
+// The relay daemon proper: it holds the configuration, wires the cycles that
+// talk to the relay's servers, owns the state they report and publishes it
+// (status file, debug dump). All of it runs in one EventLoop.
+//
+// The cycles:
+//   - RegistrationCycle: the control server learns our identity and services;
+//   - AliasCycle: the public alias stays registered once we are;
+//   - a tunnel cycle joins here the same way: wired in the constructor, told
+//     about registration and reload, and given its part of the debug dump.
 #ifndef ZEPARELAYD_TOOL_RELAY_DAEMON_H
 #define ZEPARELAYD_TOOL_RELAY_DAEMON_H
 
 #include <json/value.h>
 
-#include <boost/shared_ptr.hpp>
-#include <cstdint>
 #include <memory>
 #include <string>
 
 #include <zeparelayd/config.h>
 #include <zeparelayd/errors.h>
-#include <zeparelayd/request.h>
-#include <zeparelayd/request_alias.h>
 
+#include "alias_cycle.h"
+#include "clock.h"
 #include "event_loop.h"
+#include "registration_cycle.h"
 
 namespace zeparelayd {
 
@@ -33,11 +38,11 @@ void ApplyLogSettings(const ZEPA::Relay::RelaydConf& conf);
 //   7 "logout"     the relay is switched off ("runrelayd" is not "yes"); the
 //                  daemon idles until the next reload
 //   8 "stoped"     the daemon has stopped (written last, on the way out)
-// 4 "direct_connect" and 6 (the tunnel's "connected") are not used by this
-// daemon: it never opens a tunnel.
+// 4 "direct_connect" and 6 (the tunnel's "connected") are not used yet: this
+// daemon does not open a tunnel.
 class RelayDaemon {
 public:
-    RelayDaemon(const std::string& confPath, EventLoop& loop);
+    RelayDaemon(const std::string& confPath, EventLoop& loop, const Clock& clock);
 
     // Log settings of the configuration; called at start and on every reload.
     void ApplyLogSettings();
@@ -52,19 +57,8 @@ public:
     void Shutdown();
 
 private:
-    // ---- registration (registration.cpp) -------------------------------------
-    void StartRegistration();
-    void OnRegistrationDone(boost::shared_ptr<ZEPA::Relay::Request> req);
-    Json::Value RegistrationBody();
-    bool StoreServerId(const std::string& id);
-    void ScheduleRegistrationRetry();
-
-    // ---- alias cycle (alias_cycle.cpp) ---------------------------------------
-    void ScheduleAlias(ZEPA::Relay::ALIAS_REQUEST_CMD cmd, int64_t delayMs, const char* why);
-    void RunAlias(ZEPA::Relay::ALIAS_REQUEST_CMD cmd);
-    void OnAliasDone(ZEPA::Relay::ALIAS_REQUEST_CMD cmd, boost::shared_ptr<ZEPA::Relay::Request> req);
-    void RecordAliasStatus(const std::string& word, const std::string& extra);
-    void StopAliasCycle();
+    void Reload();
+    void ReapChildren();
 
     // ---- published files (status_writer.cpp) ---------------------------------
     void SetState(ZEPA::Relay::RELAYD_STATE state, ZEPA::Relay::RELAYD_RET error);
@@ -72,29 +66,14 @@ private:
     void RenderDebugDump();
     Json::Value DebugDump() const;
 
-    // ---- signals (relay_daemon.cpp) -----------------------------------------
-    void Reload();
-    void ReapChildren();
-
-    std::string _confPath;
     EventLoop& _loop;
+    const Clock& _clock;
     std::unique_ptr<ZEPA::Relay::RelaydConf> _conf;
     ZEPA::Relay::RELAYD_STATE _state;
     ZEPA::Relay::RELAYD_RET _error;
     Json::Value _lastStatus;
-
-    // Registration bookkeeping.
-    int _regFailures;
-    bool _regHalted;  // a failure that only a reload can cure
-
-    // Alias bookkeeping.
-    int _aliasFailures;
-    bool _aliasHalted;  // stop-class answer: automatic retries wait for a reload
-    bool _aliasMapped;  // the alias was mapped since the last (re)registration
-    std::string _aliasWord;
-    std::string _aliasExtra;
-    int _aliasRetryClass;
-    std::string _aliasNextCmd;
+    RegistrationCycle _registration;
+    AliasCycle _alias;
 };
 
 }  // namespace zeparelayd

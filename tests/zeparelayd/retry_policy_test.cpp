@@ -1,0 +1,277 @@
+// The daemon's retry policies against a clock the test moves by hand.
+#include <gtest/gtest.h>
+
+#include <climits>
+#include <cstdlib>
+#include <vector>
+
+#include "retry_policy.h"
+
+using namespace ZEPA::Relay;
+using zeparelayd::AliasPolicy;
+using zeparelayd::AliasStep;
+using zeparelayd::RegistrationPolicy;
+
+namespace {
+
+class FakeClock : public zeparelayd::Clock {
+public:
+    int64_t NowMs() const override { return _now; }
+    void Advance(int64_t ms) { _now += ms; }
+
+private:
+    int64_t _now = 5000000;
+};
+
+// A jitter source that gives the value the test sets.
+struct FixedRandom {
+    long value = 0;
+    zeparelayd::RandomSource Source() {
+        return [this] { return value; };
+    }
+};
+
+class RegistrationPolicyTest : public ::testing::Test {
+protected:
+    FakeClock clock;
+    FixedRandom jitter;
+    RegistrationPolicy policy{clock, jitter.Source()};
+};
+
+TEST_F(RegistrationPolicyTest, FailuresWaitThirtySecondsDoublingUpToThirtyMinutes) {
+    const std::vector<int64_t> expected = {30000, 60000, 120000, 240000, 480000, 960000, 1800000, 1800000};
+    for (size_t i = 0; i < expected.size(); ++i) {
+        EXPECT_EQ(expected[i], policy.OnFailure(RELAYD_ERR_NETWORK)) << "failure " << i + 1;
+        EXPECT_EQ(static_cast<int>(i + 1), policy.Failures());
+    }
+    EXPECT_FALSE(policy.Halted());
+}
+
+TEST_F(RegistrationPolicyTest, JitterAddsUpToAQuarterOfTheWait) {
+    jitter.value = 7500;  // a quarter of 30 s: the most jitter there is
+    EXPECT_EQ(37500, policy.BackoffMs(1));
+    jitter.value = 7501;  // one more wraps round to no jitter
+    EXPECT_EQ(30000, policy.BackoffMs(1));
+    jitter.value = LONG_MIN;  // any value a source gives stays within the bounds
+    EXPECT_GE(policy.BackoffMs(7), 1800000);
+    EXPECT_LE(policy.BackoffMs(7), 1800000 + 450000);
+
+    // The daemon's own source spreads over the whole range, never outside it.
+    RegistrationPolicy real(clock, [] { return random(); });
+    int64_t lowest = LLONG_MAX, highest = 0;
+    for (int i = 0; i < 2000; ++i) {
+        const int64_t delay = real.BackoffMs(2);
+        ASSERT_GE(delay, 60000);
+        ASSERT_LE(delay, 75000);
+        lowest = std::min(lowest, delay);
+        highest = std::max(highest, delay);
+    }
+    EXPECT_LT(lowest, 61000);
+    EXPECT_GT(highest, 74000);
+}
+
+TEST_F(RegistrationPolicyTest, TheWaitRunsOutOnTheClock) {
+    EXPECT_EQ(-1, policy.RemainingMs());
+    ASSERT_EQ(30000, policy.OnFailure(RELAYD_ERR_SERVER_BUSY));
+    EXPECT_EQ(30000, policy.RemainingMs());
+    clock.Advance(12000);
+    EXPECT_EQ(18000, policy.RemainingMs());
+    clock.Advance(40000);
+    EXPECT_EQ(0, policy.RemainingMs());
+    policy.OnAttempt();
+    EXPECT_EQ(-1, policy.RemainingMs());
+}
+
+TEST_F(RegistrationPolicyTest, NameResolutionFailureRetriesAfterTenSeconds) {
+    policy.OnFailure(RELAYD_ERR_NETWORK);
+    for (int i = 0; i < 5; ++i) EXPECT_EQ(10000, policy.OnFailure(RELAYD_ERR_RESOLV));
+    EXPECT_EQ(10000, policy.RemainingMs());
+    // Resolve failures do not lengthen the ordinary backoff.
+    EXPECT_EQ(60000, policy.OnFailure(RELAYD_ERR_NETWORK));
+}
+
+TEST_F(RegistrationPolicyTest, FailuresOnlyAReloadCuresWaitForIt) {
+    for (RELAYD_RET err :
+         {RELAYD_ERR_AUTH, RELAYD_ERR_NOT_SUPPORT, RELAYD_ERR_API_KEY_EXPIRED, RELAYD_ERR_CONFIG}) {
+        policy.Reset();
+        policy.OnFailure(RELAYD_ERR_NETWORK);
+        EXPECT_EQ(RegistrationPolicy::WAIT_FOR_RELOAD, policy.OnFailure(err)) << err;
+        EXPECT_TRUE(policy.Halted()) << err;
+        EXPECT_EQ(-1, policy.RemainingMs()) << err;
+    }
+    policy.Reset();
+    EXPECT_FALSE(policy.Halted());
+    EXPECT_EQ(0, policy.Failures());
+    EXPECT_EQ(30000, policy.OnFailure(RELAYD_ERR_UNKNOWN));
+}
+
+TEST_F(RegistrationPolicyTest, ARunOfServerMovesBacksOffAfterTheFirst) {
+    EXPECT_EQ(0, policy.OnServerMoved());
+    EXPECT_EQ(30000, policy.OnServerMoved());
+    EXPECT_EQ(60000, policy.OnServerMoved());
+    EXPECT_EQ(3, policy.Moves());
+    for (int i = 0; i < 20; ++i) policy.OnServerMoved();
+    EXPECT_EQ(1800000, policy.OnServerMoved());
+    EXPECT_EQ(1800000, policy.RemainingMs());
+    // A success ends the run: the next move is followed at once again.
+    policy.OnSuccess();
+    EXPECT_EQ(0, policy.Moves());
+    EXPECT_EQ(0, policy.OnServerMoved());
+}
+
+TEST_F(RegistrationPolicyTest, SuccessStartsTheBackoffAfresh) {
+    policy.OnFailure(RELAYD_ERR_NETWORK);
+    policy.OnFailure(RELAYD_ERR_NETWORK);
+    policy.OnSuccess();
+    EXPECT_EQ(0, policy.Failures());
+    EXPECT_EQ(-1, policy.RemainingMs());
+    EXPECT_EQ(30000, policy.OnFailure(RELAYD_ERR_NETWORK));
+}
+
+TEST_F(RegistrationPolicyTest, DumpShowsTheBookkeeping) {
+    policy.OnFailure(RELAYD_ERR_NETWORK);
+    policy.OnServerMoved();
+    clock.Advance(1000);
+    Json::Value dump;
+    policy.Dump(dump);
+    EXPECT_EQ(1, dump["failures"].asInt());
+    EXPECT_EQ(1, dump["moves"].asInt());
+    EXPECT_FALSE(dump["halted"].asBool());
+    EXPECT_EQ(0, dump["retry_in_ms"].asInt64());
+}
+
+class AliasPolicyTest : public ::testing::Test {
+protected:
+    static constexpr int POLL = 300;
+
+    AliasStep Outcome(ALIAS_RET ret, ALIAS_REQUEST_CMD cmd = ALIAS_REQ_KEEP_ALIVE) {
+        return policy.OnOutcome(cmd, ret, POLL, 420);
+    }
+
+    FakeClock clock;
+    FixedRandom jitter;
+    AliasPolicy policy{clock, jitter.Source()};
+};
+
+TEST_F(AliasPolicyTest, RegistrationMapsFirstAndKeepsAliveOnceMapped) {
+    AliasStep step = policy.OnRegistered();
+    EXPECT_TRUE(step.run);
+    EXPECT_EQ(ALIAS_REQ_MAP, step.cmd);
+    EXPECT_EQ(0, step.delayMs);
+
+    step = Outcome(ALIAS_RET_SUCCESS, ALIAS_REQ_MAP);
+    EXPECT_TRUE(step.run);
+    EXPECT_EQ(ALIAS_REQ_KEEP_ALIVE, step.cmd);
+    EXPECT_EQ(420000, step.delayMs);
+    EXPECT_EQ(420000, policy.RemainingMs());
+    EXPECT_TRUE(policy.Mapped());
+
+    step = policy.OnRegistered();
+    EXPECT_EQ(ALIAS_REQ_KEEP_ALIVE, step.cmd);
+}
+
+TEST_F(AliasPolicyTest, NormalClassBacksOffUpToThePollPeriod) {
+    for (ALIAS_RET ret : {ALIAS_RET_NETWORK, ALIAS_RET_SERVER_BUSY, ALIAS_RET_UNKNOWN, ALIAS_RET_SYSTEM}) {
+        policy.Reset();
+        const std::vector<int64_t> expected = {60000, 120000, 240000, 300000, 300000};
+        for (size_t i = 0; i < expected.size(); ++i) {
+            AliasStep step = Outcome(ret);
+            EXPECT_TRUE(step.run) << ret;
+            EXPECT_FALSE(step.cleanDns) << ret;
+            EXPECT_EQ(ALIAS_REQ_KEEP_ALIVE, step.cmd) << ret;
+            EXPECT_EQ(expected[i], step.delayMs) << ret << " failure " << i + 1;
+        }
+        EXPECT_EQ(ALIAS_RETRY_NORMAL, policy.RetryClass());
+    }
+    // A short poll period still waits a minute.
+    policy.Reset();
+    EXPECT_EQ(60000, policy.OnOutcome(ALIAS_REQ_MAP, ALIAS_RET_NETWORK, 10, 0).delayMs);
+    EXPECT_EQ(60000, policy.OnOutcome(ALIAS_REQ_MAP, ALIAS_RET_NETWORK, 10, 0).delayMs);
+}
+
+TEST_F(AliasPolicyTest, NormalJitterAddsUpToHalfTheWait) {
+    jitter.value = 30000;
+    EXPECT_EQ(90000, policy.NormalBackoffMs(1, POLL));
+    jitter.value = 30001;
+    EXPECT_EQ(60000, policy.NormalBackoffMs(1, POLL));
+    jitter.value = 150000;
+    EXPECT_EQ(450000, policy.NormalBackoffMs(9, POLL));
+}
+
+TEST_F(AliasPolicyTest, AliasNotFoundMapsAgain) {
+    Outcome(ALIAS_RET_SUCCESS, ALIAS_REQ_MAP);
+    ASSERT_TRUE(policy.Mapped());
+    AliasStep step = Outcome(ALIAS_RET_NOT_FOUND, ALIAS_REQ_KEEP_ALIVE);
+    EXPECT_TRUE(step.run);
+    EXPECT_EQ(ALIAS_REQ_MAP, step.cmd);
+    EXPECT_EQ(60000, step.delayMs);
+    EXPECT_FALSE(policy.Mapped());
+    EXPECT_EQ(ALIAS_REQ_MAP, policy.OnRegistered().cmd);
+}
+
+TEST_F(AliasPolicyTest, ResolveClassForgetsTheCacheAndRetriesWithinHalfAMinute) {
+    jitter.value = 0;
+    AliasStep step = Outcome(ALIAS_RET_DNS, ALIAS_REQ_MAP);
+    EXPECT_TRUE(step.run);
+    EXPECT_TRUE(step.cleanDns);
+    EXPECT_EQ(ALIAS_REQ_MAP, step.cmd);
+    EXPECT_EQ(20000, step.delayMs);
+    EXPECT_EQ(ALIAS_RETRY_RESOLVE, policy.RetryClass());
+    jitter.value = 9999;
+    EXPECT_EQ(29999, Outcome(ALIAS_RET_DNS).delayMs);
+    jitter.value = 10000;
+    EXPECT_EQ(20000, Outcome(ALIAS_RET_DNS).delayMs);
+    // Repeated resolve failures do not grow the wait.
+    jitter.value = 0;
+    EXPECT_EQ(20000, Outcome(ALIAS_RET_DNS).delayMs);
+}
+
+TEST_F(AliasPolicyTest, StopClassWaitsForAReload) {
+    for (ALIAS_RET ret : {ALIAS_RET_AUTH, ALIAS_RET_BAD_IP, ALIAS_RET_INUSED, ALIAS_RET_SELF_INUSED}) {
+        policy.Reset();
+        policy.OnRegistered();
+        AliasStep step = Outcome(ret);
+        EXPECT_FALSE(step.run) << ret;
+        EXPECT_TRUE(policy.Halted()) << ret;
+        EXPECT_EQ(ALIAS_RETRY_STOP, policy.RetryClass()) << ret;
+        EXPECT_EQ(-1, policy.RemainingMs()) << ret;
+        // A new registration does not restart it ...
+        EXPECT_FALSE(policy.OnRegistered().run) << ret;
+        // ... an explicit request does, at once.
+        AliasStep asked = policy.OnRequested();
+        EXPECT_TRUE(asked.run);
+        EXPECT_EQ(0, asked.delayMs);
+    }
+    policy.Reset();
+    EXPECT_FALSE(policy.Halted());
+    EXPECT_TRUE(policy.OnRegistered().run);
+}
+
+TEST_F(AliasPolicyTest, IncompleteDataWaitsForAReload) {
+    policy.OnIncompleteData();
+    EXPECT_TRUE(policy.Halted());
+    EXPECT_FALSE(policy.OnRegistered().run);
+}
+
+TEST_F(AliasPolicyTest, ARequestThatDidNotStartCountsAsANormalFailure) {
+    EXPECT_EQ(60000, policy.OnNotStarted(ALIAS_REQ_MAP, POLL).delayMs);
+    EXPECT_EQ(120000, policy.OnNotStarted(ALIAS_REQ_MAP, POLL).delayMs);
+    EXPECT_EQ(2, policy.Failures());
+    EXPECT_EQ(ALIAS_REQ_KEEP_ALIVE, Outcome(ALIAS_RET_SUCCESS).cmd);
+    EXPECT_EQ(0, policy.Failures());
+}
+
+TEST_F(AliasPolicyTest, TheWaitRunsOutOnTheClock) {
+    Outcome(ALIAS_RET_NETWORK);
+    clock.Advance(45000);
+    EXPECT_EQ(15000, policy.RemainingMs());
+    Json::Value dump;
+    policy.Dump(dump);
+    EXPECT_EQ(15000, dump["next_in_ms"].asInt64());
+    EXPECT_EQ(1, dump["failures"].asInt());
+    EXPECT_EQ(ALIAS_RETRY_NORMAL, dump["retry_class"].asInt());
+    policy.OnAttempt();
+    EXPECT_EQ(-1, policy.RemainingMs());
+}
+
+}  // namespace

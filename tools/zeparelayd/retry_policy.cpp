@@ -1,0 +1,165 @@
+#include "retry_policy.h"
+
+#include <algorithm>
+
+using namespace ZEPA::Relay;
+
+namespace zeparelayd {
+
+namespace {
+
+// A random share of span: 0 to span inclusive; a source may give any long.
+int64_t Jitter(const RandomSource& random, int64_t span) {
+    if (span <= 0) return 0;
+    const long r = random();
+    const int64_t value = r < 0 ? -(static_cast<int64_t>(r) + 1) : r;
+    return value % (span + 1);
+}
+
+// first, doubled per step after the first, never above cap.
+int64_t Doubling(int64_t first, int n, int64_t cap) {
+    int64_t delay = first;
+    for (int i = 1; i < n && delay < cap; ++i) delay *= 2;
+    return std::min(delay, cap);
+}
+
+}  // namespace
+
+int64_t Deadline::RemainingMs() const {
+    if (_dueMs < 0) return -1;
+    return std::max<int64_t>(_dueMs - _clock.NowMs(), 0);
+}
+
+// ---- registration ------------------------------------------------------------
+
+RegistrationPolicy::RegistrationPolicy(const Clock& clock, RandomSource random)
+    : _random(std::move(random)), _due(clock), _failures(0), _moves(0), _halted(false) {}
+
+bool RegistrationPolicy::NeedsReload(RELAYD_RET err) {
+    return err == RELAYD_ERR_AUTH || err == RELAYD_ERR_NOT_SUPPORT || err == RELAYD_ERR_API_KEY_EXPIRED ||
+           err == RELAYD_ERR_CONFIG;
+}
+
+int64_t RegistrationPolicy::BackoffMs(int n) const {
+    const int64_t delay = Doubling(FIRST_DELAY_MS, n, MAX_DELAY_MS);
+    return delay + Jitter(_random, delay / 4);
+}
+
+int64_t RegistrationPolicy::Arm(int64_t delayMs) {
+    _due.Arm(delayMs);
+    return delayMs;
+}
+
+int64_t RegistrationPolicy::OnFailure(RELAYD_RET err) {
+    if (NeedsReload(err)) {
+        _halted = true;
+        _due.Clear();
+        return WAIT_FOR_RELOAD;
+    }
+    if (err == RELAYD_ERR_RESOLV) return Arm(RESOLVE_DELAY_MS);
+    ++_failures;
+    return Arm(BackoffMs(_failures));
+}
+
+int64_t RegistrationPolicy::OnServerMoved() {
+    ++_moves;
+    return Arm(_moves == 1 ? 0 : BackoffMs(_moves - 1));
+}
+
+void RegistrationPolicy::OnSuccess() {
+    _failures = 0;
+    _moves = 0;
+    _due.Clear();
+}
+
+void RegistrationPolicy::Reset() {
+    OnSuccess();
+    _halted = false;
+}
+
+void RegistrationPolicy::Dump(Json::Value& out) const {
+    out["failures"] = _failures;
+    out["moves"] = _moves;
+    out["halted"] = _halted;
+    out["retry_in_ms"] = static_cast<Json::Int64>(RemainingMs());
+}
+
+// ---- alias -------------------------------------------------------------------
+
+AliasPolicy::AliasPolicy(const Clock& clock, RandomSource random)
+    : _random(std::move(random)),
+      _due(clock),
+      _failures(0),
+      _halted(false),
+      _mapped(false),
+      _retryClass(-1) {}
+
+int64_t AliasPolicy::NormalBackoffMs(int n, int pollSeconds) const {
+    const int64_t cap = static_cast<int64_t>(std::max(pollSeconds, 60)) * 1000;
+    const int64_t delay = Doubling(FIRST_DELAY_MS, n, cap);
+    return delay + Jitter(_random, delay / 2);
+}
+
+AliasStep AliasPolicy::Run(ALIAS_REQUEST_CMD cmd, int64_t delayMs, bool cleanDns) {
+    _due.Arm(delayMs);
+    return AliasStep{true, cmd, delayMs, cleanDns};
+}
+
+AliasStep AliasPolicy::Halt() {
+    _halted = true;
+    _due.Clear();
+    return AliasStep{false, ALIAS_REQ_MAP, -1, false};
+}
+
+AliasStep AliasPolicy::OnRegistered() {
+    if (_halted) return AliasStep{false, ALIAS_REQ_MAP, -1, false};
+    return Run(_mapped ? ALIAS_REQ_KEEP_ALIVE : ALIAS_REQ_MAP, 0);
+}
+
+AliasStep AliasPolicy::OnRequested() { return Run(ALIAS_REQ_MAP, 0); }
+
+AliasStep AliasPolicy::OnOutcome(ALIAS_REQUEST_CMD cmd, ALIAS_RET ret, int pollSeconds, int pollingSeconds) {
+    ALIAS_RETRY_TYPE type = ALIAS_RETRY_NORMAL;
+    AliasRequest::GetRetryType(ret, type);
+    _retryClass = type;
+    if (ret == ALIAS_RET_SUCCESS) {
+        _failures = 0;
+        _mapped = true;
+        return Run(ALIAS_REQ_KEEP_ALIVE, static_cast<int64_t>(pollingSeconds) * 1000);
+    }
+    ++_failures;
+    switch (type) {
+        case ALIAS_RETRY_STOP:
+            return Halt();
+        case ALIAS_RETRY_RESOLVE:
+            return Run(cmd, RESOLVE_DELAY_MS + Jitter(_random, RESOLVE_JITTER_MS - 1), true);
+        default:
+            if (ret == ALIAS_RET_NOT_FOUND) {
+                _mapped = false;
+                cmd = ALIAS_REQ_MAP;
+            }
+            return Run(cmd, NormalBackoffMs(_failures, pollSeconds));
+    }
+}
+
+AliasStep AliasPolicy::OnNotStarted(ALIAS_REQUEST_CMD cmd, int pollSeconds) {
+    ++_failures;
+    return Run(cmd, NormalBackoffMs(_failures, pollSeconds));
+}
+
+void AliasPolicy::Reset() {
+    _failures = 0;
+    _halted = false;
+    _mapped = false;
+    _due.Clear();
+}
+
+void AliasPolicy::Dump(Json::Value& out) const {
+    out["retry_class"] = _retryClass;
+    out["failures"] = _failures;
+    out["halted"] = _halted;
+    out["mapped"] = _mapped;
+    out["next_in_ms"] = static_cast<Json::Int64>(RemainingMs());
+}
+
+}  // namespace zeparelayd
