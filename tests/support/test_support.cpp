@@ -1,5 +1,6 @@
 #include "support/test_support.h"
 
+#include <dirent.h>
 #include <fcntl.h>
 #include <json/reader.h>
 #include <json/writer.h>
@@ -142,6 +143,21 @@ void WriteFile(const std::string& path, const std::string& content, mode_t mode)
 }
 
 bool FileExists(const std::string& path) { return access(path.c_str(), F_OK) == 0; }
+
+std::vector<std::string> TemporariesOf(const std::string& path) {
+    std::string::size_type slash = path.rfind('/');
+    std::string folder = slash == std::string::npos ? "." : path.substr(0, slash == 0 ? 1 : slash);
+    std::string prefix = (slash == std::string::npos ? path : path.substr(slash + 1)) + ".tmp.";
+    std::vector<std::string> names;
+    DIR* dir = opendir(folder.c_str());
+    if (dir == nullptr) return names;
+    for (dirent* e = readdir(dir); e != nullptr; e = readdir(dir)) {
+        std::string name = e->d_name;
+        if (name.compare(0, prefix.size(), prefix) == 0) names.push_back(name);
+    }
+    closedir(dir);
+    return names;
+}
 
 void MakeDirs(const std::string& path) {
     std::string cur;

@@ -72,6 +72,9 @@ void WriteFile(const std::string& path, const std::string& content, mode_t mode 
 bool FileExists(const std::string& path);
 void MakeDirs(const std::string& path);
 mode_t FileMode(const std::string& path);
+// Names in path's folder that start with path's name + ".tmp.": temporary
+// files of writes to path.
+std::vector<std::string> TemporariesOf(const std::string& path);
 Json::Value ParseJson(const std::string& text);
 std::string ToJson(const Json::Value& value);
 
