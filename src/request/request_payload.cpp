@@ -2,11 +2,11 @@
 // description record.
 #define ZEPA_LOG_SOURCE "request"
 
-#include <json/reader.h>
 #include <json/writer.h>
 #include <zeparelayd/errors.h>
 #include <zeparelayd/request.h>
 
+#include "common/file_io.h"
 #include "common/log.h"
 
 namespace ZEPA {
@@ -20,13 +20,12 @@ std::string Serialise(const Json::Value& data) {
 }
 
 bool Parse(const std::string& text, Json::Value& out) {
-    Json::Reader reader;
     Json::Value parsed;
-    if (reader.parse(text, parsed, false)) {
+    if (FileIo::ParseJson(text, parsed)) {
         out.swap(parsed);
         return true;
     }
-    ZLOG(ZEPA_LOG_DEBUG, "failed to parse response: %s", text.c_str());
+    ZLOG(ZEPA_LOG_DEBUG, "failed to parse response: %s", FileIo::ClipForLog(text).c_str());
     return false;
 }
 
