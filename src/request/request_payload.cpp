@@ -33,8 +33,7 @@ bool Parse(const std::string& text, Json::Value& out) {
 // text as it stands.
 std::string MaskedBody(const std::string& data) {
     Json::Value parsed;
-    Json::Reader reader;
-    if (!data.empty() && (data[0] == '{' || data[0] == '[') && reader.parse(data, parsed, false)) {
+    if (!data.empty() && (data[0] == '{' || data[0] == '[') && FileIo::ParseJson(data, parsed)) {
         const Json::Value masked = MaskSecrets(parsed);
         if (masked == parsed) return data;
         std::string text = Serialise(masked);
