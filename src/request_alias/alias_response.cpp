@@ -171,7 +171,8 @@ bool AliasRequest::GetResponseForDaemon(boost::shared_ptr<Request> req, ALIAS_RE
         return false;
     }
     if (!ParseServerResponse(body, code)) {
-        ZLOG(ZEPA_LOG_ERR, "Unknown response: %s", FileIo::ClipForLog(MaskAnswer(body, req->GetData())).c_str());
+        ZLOG(ZEPA_LOG_ERR, "Unknown response: %s",
+             FileIo::ClipForLog(MaskAnswer(body, req->GetData())).c_str());
         return false;
     }
     const std::string::size_type colon = body.find(':');
