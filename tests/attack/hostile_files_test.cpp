@@ -55,24 +55,7 @@ protected:
 
     // Plants a hostile object of kind at absPath below the root.
     void Plant(const std::string& kind, const std::string& absPath) const {
-        const std::string path = root.path(absPath);
-        if (kind == "fifo") {
-            ASSERT_EQ(0, mkfifo(path.c_str(), 0666));
-        } else if (kind == "folder") {
-            zepatest::MakeDirs(path + "/inside");
-        } else if (kind == "device") {
-            ASSERT_EQ(0, symlink("/dev/zero", path.c_str()));
-        } else if (kind == "huge") {
-            // 1 GiB without the disk space: a sparse file.
-            int fd = open(path.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
-            ASSERT_GE(fd, 0);
-            ASSERT_EQ(0, ftruncate(fd, 1024L * 1024 * 1024));
-            close(fd);
-        } else if (kind == "nested") {
-            root.write(absPath, "{\"a\": " + Nested(1001) + "}");
-        } else {
-            FAIL() << kind;
-        }
+        ASSERT_TRUE(zepatest::PlantHostile(kind, root.path(absPath))) << kind;
     }
 };
 
@@ -109,9 +92,7 @@ TEST_F(HostileFiles, ConfigurationThatIsNoFileFailsToLoadAndKeepsTheDefaults) {
             return conf.serverID == "default" ? 0 : 2;
         });
         EXPECT_EQ(0, code);
-        std::string path = root.path(CONF);
-        std::string cmd = "rm -rf '" + path + "' '" + path + ".bad'";
-        ASSERT_EQ(0, system(cmd.c_str()));
+        zepatest::RemoveWithBad(root.path(CONF));
     }
 }
 
@@ -125,9 +106,7 @@ TEST_F(HostileFiles, AliasStatusThatIsNoFileIsInvalid) {
             return status.IsValid() || status.GetStatus("myalias", word, extra) ? 1 : 0;
         });
         EXPECT_EQ(0, code);
-        std::string path = root.path(ALIAS_STATUS);
-        std::string cmd = "rm -rf '" + path + "' '" + path + ".bad'";
-        ASSERT_EQ(0, system(cmd.c_str()));
+        zepatest::RemoveWithBad(root.path(ALIAS_STATUS));
     }
 }
 
@@ -144,11 +123,7 @@ TEST_F(HostileFiles, PermissionAndRegionFilesThatAreNoFilesReadAsAbsent) {
             return server.GetRegion() == "abc" ? 0 : 2;
         });
         EXPECT_EQ(0, code);
-        for (const char* name : {PERMISSION_CONF, ENV_CONF}) {
-            std::string path = root.path(name);
-            std::string cmd = "rm -rf '" + path + "' '" + path + ".bad'";
-            ASSERT_EQ(0, system(cmd.c_str()));
-        }
+        for (const char* name : {PERMISSION_CONF, ENV_CONF}) zepatest::RemoveWithBad(root.path(name));
     }
 }
 

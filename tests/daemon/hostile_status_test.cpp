@@ -48,6 +48,25 @@ int InOwnGroup(const std::function<int()>& body) {
     return WEXITSTATUS(status);
 }
 
+// A live child that is no daemon: it waits until release is closed, and the
+// default action of every signal would end it.
+pid_t IdleChild(int& release) {
+    int fds[2];
+    if (pipe(fds) != 0) return -1;
+    fflush(nullptr);
+    pid_t pid = fork();
+    if (pid == 0) {
+        close(release);
+        char c;
+        ssize_t unused = read(fds[0], &c, 1);
+        (void)unused;
+        _exit(0);
+    }
+    close(fds[0]);
+    release = fds[1];
+    return pid;
+}
+
 class HostileStatus : public DaemonTest {
 protected:
     void SetUp() override {
@@ -59,24 +78,7 @@ protected:
         DaemonTest::TearDown();
     }
     void PlantStatus(const std::string& kind) const {
-        const std::string path = root.path(STATUS);
-        std::string cmd = "rm -rf '" + path + "'";
-        ASSERT_EQ(0, system(cmd.c_str()));
-        if (kind == "fifo") {
-            ASSERT_EQ(0, mkfifo(path.c_str(), 0666));
-        } else if (kind == "folder") {
-            zepatest::MakeDirs(path + "/inside");
-        } else if (kind == "device") {
-            ASSERT_EQ(0, symlink("/dev/zero", path.c_str()));
-        } else if (kind == "huge") {
-            int fd = open(path.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
-            ASSERT_GE(fd, 0);
-            ASSERT_EQ(0, ftruncate(fd, 1024L * 1024 * 1024));
-            close(fd);
-        } else if (kind == "nested") {
-            root.write(STATUS, "{\"pid\": " + std::to_string(getpid()) +
-                                   ", \"x\": " + std::string(1001, '[') + std::string(1001, ']') + "}");
-        }
+        ASSERT_TRUE(zepatest::PlantHostile(kind, root.path(STATUS))) << kind;
     }
 
 private:
@@ -117,23 +119,15 @@ TEST_F(HostileStatus, PidsThatNameProcessGroupsAreNeverSignalled) {
 
 TEST_F(HostileStatus, ALiveProcessThatIsNoDaemonIsNotRunningAndGetsNoSignal) {
     // A plain child: alive, but not of the daemon's name.
-    int fds[2];
-    ASSERT_EQ(0, pipe(fds));
-    pid_t other = fork();
-    if (other == 0) {
-        close(fds[1]);
-        char c;
-        ssize_t unused = read(fds[0], &c, 1);
-        (void)unused;
-        _exit(0);
-    }
-    close(fds[0]);
+    int release = -1;
+    pid_t other = IdleChild(release);
+    ASSERT_GT(other, 0);
     root.write(STATUS, "{\"pid\": " + std::to_string(other) + ", \"state\": 4}");
     Json::Value out;
     EXPECT_EQ(1, Daemon::GetStatus(out));
     EXPECT_EQ(1, Daemon::UpdateAlias());
     // Had SIGRTMIN+1 reached it, its default action would have ended it.
-    close(fds[1]);
+    close(release);
     int status = Reap(other);
     ASSERT_TRUE(WIFEXITED(status));
     EXPECT_EQ(0, WEXITSTATUS(status));
@@ -160,21 +154,13 @@ TEST_F(HostileStatus, PidFileNamingZeroSignalsNobody) {
 }
 
 TEST_F(HostileStatus, PidFileNamingAnotherProgramGetsNoDebugSignal) {
-    int fds[2];
-    ASSERT_EQ(0, pipe(fds));
-    pid_t other = fork();
-    if (other == 0) {
-        close(fds[1]);
-        char c;
-        ssize_t unused = read(fds[0], &c, 1);
-        (void)unused;
-        _exit(0);
-    }
-    close(fds[0]);
+    int release = -1;
+    pid_t other = IdleChild(release);
+    ASSERT_GT(other, 0);
     WritePidFile(other);
     Json::Value out;
     EXPECT_EQ(1, Daemon::DebugStatus(out));
-    close(fds[1]);
+    close(release);
     int status = Reap(other);
     ASSERT_TRUE(WIFEXITED(status));
     EXPECT_FALSE(zepatest::FileExists(DebugFile(other)));
