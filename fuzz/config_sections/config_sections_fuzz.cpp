@@ -2,8 +2,6 @@
 // not crash, and the written form must read back to the same section.
 #include <json/reader.h>
 #include <json/writer.h>
-#include <unistd.h>
-#include <zepasdk/sysroot.h>
 
 #include <cstdint>
 #include <cstdio>
@@ -14,34 +12,12 @@
 #include <zeparelayd/config_alias.h>
 #include <zeparelayd/daemon.h>
 
+#include "fuzz_support.h"
+
 using namespace ZEPA::Relay;
+using fuzzsupport::Check;
 
 namespace {
-
-// A private root: token generation creates the device secret below it.
-void UsePrivateRoot() {
-    static bool done = false;
-    if (done) return;
-    done = true;
-    static char tmpl[] = "/tmp/zepafuzz.XXXXXX";
-    if (mkdtemp(tmpl) == nullptr) abort();
-    ZEPASysRootSet(tmpl);
-    atexit([] {
-        std::string root = tmpl;
-        unlink((root + "/etc/zepa/hubtoken.secret").c_str());
-        rmdir((root + "/etc/zepa").c_str());
-        rmdir((root + "/etc").c_str());
-        rmdir(tmpl);
-    });
-    Daemon::_logLevel = 2;  // failures of the generation are not what is tested here
-}
-
-void Check(bool ok, const char* what) {
-    if (!ok) {
-        fprintf(stderr, "property failed: %s\n", what);
-        abort();
-    }
-}
 
 std::string Text(const Config& conf, bool full) {
     Json::Value out;
@@ -65,10 +41,9 @@ void RoundTrip(const Json::Value& value, bool full, const char* name, Args... ar
 }  // namespace
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
-    UsePrivateRoot();
+    fuzzsupport::Use();  // token generation creates the device secret below it
     Json::Value value;
-    Json::Reader reader;
-    reader.parse(std::string(reinterpret_cast<const char*>(data), size), value, false);
+    fuzzsupport::Parse(std::string(reinterpret_cast<const char*>(data), size), value);
 
     RoundTrip<ServerConf>(value, true, "server section reads back", nullptr, nullptr);
     RoundTrip<MyHubConf>(value, true, "account section reads back");

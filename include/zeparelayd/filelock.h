@@ -23,7 +23,8 @@ public:
     // Entries cannot be removed: always false, the set is unchanged.
     bool RemoveFile(const char* path);
     // op is LOCK_SH or LOCK_EX; LOCK_NB is always added. Files are created
-    // (mode 0600) when missing. Held entries are skipped. On any failure
+    // (mode 0600) when missing; a symbolic link at a name is never followed (the
+    // lock fails). Held entries are skipped. On any failure
     // everything is released and the result is false (errno from the call).
     bool Lock(int op);
     // Releases and closes every entry. true unless the set is inconsistent.

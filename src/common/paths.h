@@ -49,6 +49,10 @@ constexpr const char TUNNEL_DOWN_SCRIPT[] = "/usr/zepa/etc.defaults/zeparelayd/s
 constexpr const char OPENVPN[] = "/usr/sbin/openvpn";
 constexpr const char IPTABLESTOOL[] = "/usr/zepa/bin/iptablestool";
 
+// Process information of the running system; never resolved against the root,
+// since the processes a root's files name are real.
+constexpr const char PROC_DIR[] = "/proc/";
+
 // root + absPath ("/" root: absPath unchanged).
 std::string Resolve(const std::string& absPath);
 

@@ -11,6 +11,7 @@
 
 #include "common/log.h"
 #include "common/paths.h"
+#include "config/config_lock.h"
 
 namespace ZEPA {
 namespace Relay {
@@ -59,6 +60,8 @@ bool RelaydConf::WriteConfigFile(const std::string& confPath) {
         ZLOG(ZEPA_LOG_ERR, "invalid relayd config");
         return false;
     }
+    ConfigWriteLock lock(confPath);
+    if (!lock.Held()) return false;
     Json::Value old;
     if (!ReadJsonFile(confPath, old)) {
         ZLOG(ZEPA_LOG_WARNING, "drop crrupted config: [%s]", confPath.c_str());

@@ -7,6 +7,7 @@
 #include <zeparelayd/config.h>
 
 #include "common/log.h"
+#include "config/config_lock.h"
 
 namespace ZEPA {
 namespace Relay {
@@ -37,6 +38,10 @@ bool RelaydConf::BeginFieldWrite(const std::string& argPath, std::string& file, 
 }
 
 bool RelaydConf::WriteServerId(const std::string& argPath) {
+    // Held from the read to the rename: another process's change in between
+    // would otherwise be overwritten.
+    ConfigWriteLock lock(argPath.empty() ? path : argPath);
+    if (!lock.Held()) return false;
     std::string file;
     Json::Value value;
     if (!BeginFieldWrite(argPath, file, value)) return false;
@@ -45,6 +50,10 @@ bool RelaydConf::WriteServerId(const std::string& argPath) {
 }
 
 bool RelaydConf::WriteAliasName(const std::string& argPath, const std::string& aliasName) {
+    // Held from the read to the rename: another process's change in between
+    // would otherwise be overwritten.
+    ConfigWriteLock lock(argPath.empty() ? path : argPath);
+    if (!lock.Held()) return false;
     std::string file;
     Json::Value value;
     if (!BeginFieldWrite(argPath, file, value)) return false;
@@ -54,6 +63,10 @@ bool RelaydConf::WriteAliasName(const std::string& argPath, const std::string& a
 }
 
 bool RelaydConf::WriteMyHubAccount(const std::string& argPath, const std::string& account) {
+    // Held from the read to the rename: another process's change in between
+    // would otherwise be overwritten.
+    ConfigWriteLock lock(argPath.empty() ? path : argPath);
+    if (!lock.Held()) return false;
     std::string file;
     Json::Value value;
     if (!BeginFieldWrite(argPath, file, value)) return false;
@@ -63,6 +76,10 @@ bool RelaydConf::WriteMyHubAccount(const std::string& argPath, const std::string
 }
 
 bool RelaydConf::WriteControlServerHost(const std::string& argPath, const std::string& host) {
+    // Held from the read to the rename: another process's change in between
+    // would otherwise be overwritten.
+    ConfigWriteLock lock(argPath.empty() ? path : argPath);
+    if (!lock.Held()) return false;
     std::string file;
     Json::Value value;
     if (!BeginFieldWrite(argPath, file, value)) return false;

@@ -8,12 +8,13 @@
 #include <unistd.h>
 
 #include <cstdio>
-#include <fstream>
+#include <exception>
 #include <iostream>
 #include <string>
 
 #include <zeparelayd/config.h>
 
+#include "common/file_io.h"
 #include "common/log.h"
 
 namespace ZEPA {
@@ -24,19 +25,28 @@ Config::~Config() = default;
 std::ostream& operator<<(std::ostream& os, const Config& conf) {
     Json::Value full;
     conf.Write(full, true);
-    Json::FastWriter writer;
-    os << writer.write(full);
+    try {
+        Json::FastWriter writer;
+        os << writer.write(full);
+    } catch (const std::exception&) {
+        // A stream set to throw, or no memory left: the stream stays failed.
+        try {
+            os.setstate(std::ios::badbit);
+        } catch (const std::exception&) {
+        }
+    }
     return os;
 }
 
 bool RelaydConf::ReadJsonFile(const std::string& path, Json::Value& value) {
     value = Json::Value();
     if (path.empty()) return true;
-    std::ifstream in(path.c_str());
-    if (!in.is_open()) return true;  // a missing file shows itself as null
+    // A missing, unreadable, oversized or non-regular file (a FIFO, device or
+    // folder planted at the name) shows itself as null, without blocking.
+    std::string text;
+    if (FileIo::ReadRegular(path, FileIo::MAX_FILE_BYTES, text) != FileIo::ReadResult::OK) return true;
 
-    Json::Reader reader;
-    if (!reader.parse(in, value, false)) {
+    if (!FileIo::ParseJson(text, value)) {
         ZLOG(ZEPA_LOG_ERR, "bad json format [%s]", path.c_str());
         const std::string bad = path + ".bad";
         if (rename(path.c_str(), bad.c_str()) != 0) {
@@ -48,37 +58,55 @@ bool RelaydConf::ReadJsonFile(const std::string& path, Json::Value& value) {
     return true;
 }
 
-bool RelaydConf::WriteJsonFile(const std::string& path, const Json::Value& value) {
-    Json::StyledWriter writer;
-    if (path == "-") {
-        std::cout << writer.write(value) << std::flush;
+namespace {
+
+bool StyledText(const Json::Value& value, std::string& text) {
+    try {
+        Json::StyledWriter writer;
+        text = writer.write(value);
         return true;
-    }
-    const std::string tmp = path + ".tmp." + std::to_string(getpid());
-    // An empty target names no file: its temporary file is never created in
-    // whatever folder the process happens to run in.
-    std::ofstream out;
-    if (!path.empty()) out.open(tmp.c_str(), std::ios::out | std::ios::trunc);
-    if (!out.is_open()) {
-        ZLOG(ZEPA_LOG_ERR, "open failed [%s]", tmp.c_str());
-        unlink(tmp.c_str());
+    } catch (const std::exception&) {
         return false;
     }
-    out << writer.write(value);
-    out.flush();
-    bool result = out.good();
-    out.close();
-    if (out.fail()) result = false;
+}
+
+}  // namespace
+
+bool RelaydConf::WriteJsonFile(const std::string& path, const Json::Value& value) {
+    std::string text;
+    if (!StyledText(value, text)) return false;
+    if (path == "-") {
+        std::cout << text << std::flush;
+        return true;
+    }
+    // An empty target names no file: its temporary file is never created in
+    // whatever folder the process happens to run in.
+    std::string tmp = path + ".tmp." + std::to_string(getpid());
+    int fd = -1;
+    if (!path.empty()) {
+        FileIo::RemoveStaleTemporaries(path);
+        // Exclusive and unpredictable: nothing planted at the name is written through.
+        fd = FileIo::CreateTemporary(path, tmp);
+    }
+    if (fd < 0) {
+        ZLOG(ZEPA_LOG_ERR, "open failed [%s]", tmp.c_str());
+        return false;
+    }
+    // The data reaches the disk before the name does, so that a power loss
+    // leaves the old file or the new one, never an empty one.
+    bool result = FileIo::WriteAll(fd, text.data(), text.size()) && fchmod(fd, 0644) == 0 && fsync(fd) == 0;
+    if (close(fd) != 0) result = false;
     if (!result) {
         unlink(tmp.c_str());
         return false;
     }
-    chmod(tmp.c_str(), 0644);
     if (rename(tmp.c_str(), path.c_str()) != 0) {
         // Logged, not reported: the old file is still whole.
         ZLOG(ZEPA_LOG_ERR, "rename to %s failed %m", path.c_str());
         unlink(tmp.c_str());
+        return result;
     }
+    FileIo::SyncFolderOf(path);
     return result;
 }
 

@@ -9,6 +9,7 @@
 #include <zeparelayd/daemon.h>
 
 #include "common/paths.h"
+#include "config/config_lock.h"
 #include "daemon/service_ids.h"
 
 using ZEPA::Relay::Daemon;
@@ -32,6 +33,8 @@ void NotifyDaemon() {
 
 int VLIBRelaydLogStart(const char* logFile) {
     if (logFile == nullptr) return -1;
+    ZEPA::Relay::ConfigWriteLock lock(ConfPath());
+    if (!lock.Held()) return -1;
     Json::Value conf;
     if (!RelaydConf::ReadJsonFile(ConfPath(), conf) || !conf.isObject()) return -1;
     conf["log_level"] = DEBUG_LEVEL;
@@ -42,6 +45,8 @@ int VLIBRelaydLogStart(const char* logFile) {
 }
 
 int VLIBRelaydLogStop(void) {
+    ZEPA::Relay::ConfigWriteLock lock(ConfPath());
+    if (!lock.Held()) return -1;
     Json::Value conf;
     // Deliberately no object check: a missing file is rewritten as null.
     if (!RelaydConf::ReadJsonFile(ConfPath(), conf)) return -1;

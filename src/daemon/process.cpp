@@ -114,9 +114,24 @@ int Daemon::InitSignalHandler() {
                               SIGRTMIN + 1, SIGRTMIN + 5, 0);
 }
 
+namespace {
+
+// daemon_pid_file_kill, except that a PID file naming 0 (which libdaemon
+// finds "running") never makes us signal our own process group.
+int KillPidFile(int sig) {
+    pid_t pid = daemon_pid_file_is_running();
+    if (pid <= 0) {
+        errno = ESRCH;
+        return -1;
+    }
+    return kill(pid, sig);
+}
+
+}  // namespace
+
 // The three senders deliberately report a failure in three different ways.
 int Daemon::Signal(int sig) {
-    if (daemon_pid_file_kill(sig) < 0) {
+    if (KillPidFile(sig) < 0) {
         ZLOG(ZEPA_LOG_NOTICE, "Failed to signal daemon, %d", sig);
         return RELAYD_RESULT_UNAVAILABLE;
     }
@@ -124,7 +139,7 @@ int Daemon::Signal(int sig) {
 }
 
 int Daemon::Kill() {
-    if (daemon_pid_file_kill(SIGTERM) < 0) {
+    if (KillPidFile(SIGTERM) < 0) {
         ZLOG(ZEPA_LOG_NOTICE, "Failed to kill daemon");
         return RELAYD_RESULT_UNAVAILABLE;
     }
@@ -132,7 +147,7 @@ int Daemon::Kill() {
 }
 
 int Daemon::Hup() {
-    if (daemon_pid_file_kill(SIGHUP) < 0) {
+    if (KillPidFile(SIGHUP) < 0) {
         fprintf(stderr, "%s not running\n", daemon_pid_file_ident != nullptr ? daemon_pid_file_ident : "");
         return RELAYD_RESULT_UNAVAILABLE;
     }

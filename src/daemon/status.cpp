@@ -2,7 +2,6 @@
 // system log, never to the library log.
 #define ZEPA_LOG_SOURCE "daemon"
 
-#include <json/reader.h>
 #include <libdaemon/dpid.h>
 #include <sys/file.h>
 #include <syslog.h>
@@ -10,11 +9,11 @@
 
 #include <csignal>
 #include <cstdio>
-#include <fstream>
 
 #include <zeparelayd/errors.h>
 #include <zeparelayd/filelock.h>
 
+#include "common/file_io.h"
 #include "common/log.h"
 #include "common/paths.h"
 #include "common/seams.h"
@@ -35,11 +34,6 @@ const unsigned int FIRST_PAUSE_US = 50;
 const unsigned int RETRY_PAUSE_US = 100;
 const int PARSE_ATTEMPTS = 30;
 
-bool ParseStream(std::istream& in, Json::Value& out) {
-    Json::Reader reader;
-    return reader.parse(in, out, true);
-}
-
 int IntMember(const Json::Value& value, const char* key, int fallback) {
     if (!value.isObject() || !value.isMember(key) || !value[key].isInt()) return fallback;
     return value[key].asInt();
@@ -55,20 +49,20 @@ RELAYD_RET ErrorCode(int errorNo) {
 int ReadDebugDump(const std::string& path, Json::Value& out) {
     g_statusSleep(FIRST_PAUSE_US);
     for (int attempt = 1;; ++attempt) {
-        std::ifstream in(path);
-        if (!in.is_open()) {
+        // Never through a link planted at the name, never blocking on a FIFO.
+        std::string text;
+        FileIo::ReadResult read = FileIo::ReadRegular(path, FileIo::MAX_FILE_BYTES, text, false);
+        if (read != FileIo::ReadResult::OK && read != FileIo::ReadResult::TOO_LARGE) {
             ZSYSLOG(LOG_ERR, "zeparelayd status file is not ready");
             unlink(path.c_str());
             return RELAYD_RESULT_BROKEN;
         }
-        if (ParseStream(in, out)) {
-            in.close();
+        if (read == FileIo::ReadResult::OK && FileIo::ParseJson(text, out)) {
             unlink(path.c_str());
             return RELAYD_RESULT_OK;
         }
         if (attempt == PARSE_ATTEMPTS) {
             ZSYSLOG(LOG_DEBUG, "zeparelayd status parse failed");
-            in.close();
             unlink(path.c_str());
             return RELAYD_RESULT_BUSY;
         }
@@ -80,13 +74,17 @@ int ReadDebugDump(const std::string& path, Json::Value& out) {
 
 int LoadStatusFile(Json::Value& out, pid_t& pid) {
     out = Json::Value();
-    std::ifstream in(Paths::Resolve(Paths::STATUS_FILE));
-    if (!in.is_open()) return RELAYD_RESULT_NOT_RUNNING;
-    if (!ParseStream(in, out)) {
+    std::string text;
+    FileIo::ReadResult read =
+        FileIo::ReadRegular(Paths::Resolve(Paths::STATUS_FILE), FileIo::MAX_FILE_BYTES, text);
+    if (read == FileIo::ReadResult::MISSING) return RELAYD_RESULT_NOT_RUNNING;
+    // A FIFO, device, folder or oversized file is as broken as bad JSON.
+    if (read != FileIo::ReadResult::OK || !FileIo::ParseJson(text, out)) {
         ZSYSLOG(LOG_ERR, "bad zeparelayd status file");
         return RELAYD_RESULT_BROKEN;
     }
-    if (!out.isObject() || !out.isMember("pid") || !out["pid"].isInt() || out["pid"].asInt() == -1) {
+    // 0 and negative pids address process groups: never a daemon.
+    if (!out.isObject() || !out.isMember("pid") || !out["pid"].isInt() || out["pid"].asInt() <= 0) {
         ZSYSLOG(LOG_ERR, "bad zeparelayd status pid");
         return RELAYD_RESULT_BROKEN;
     }
@@ -98,7 +96,8 @@ int Daemon::GetStatus(Json::Value& out) {
     pid_t pid = 0;
     int ret = LoadStatusFile(out, pid);
     if (ret != RELAYD_RESULT_OK) return ret;
-    return kill(pid, 0) == 0 ? RELAYD_RESULT_OK : RELAYD_RESULT_NOT_RUNNING;
+    // A stale file may name a pid that an unrelated process has since taken.
+    return FileIo::IsDaemonProcess(pid) ? RELAYD_RESULT_OK : RELAYD_RESULT_NOT_RUNNING;
 }
 
 bool Daemon::GetStatus(std::string& serverId, std::string& state, std::string& error, const char* serviceId) {
@@ -130,13 +129,20 @@ int Daemon::DebugStatus(Json::Value& out) {
     out = Json::Value();
     pid_t pid = daemon_pid_file_is_running();
     if (pid < 0) return RELAYD_RESULT_NOT_RUNNING;
+    if (pid == 0) {
+        // kill(0, ...) would signal our own process group.
+        ZSYSLOG(LOG_ERR, "bad zeparelayd status pid");
+        return RELAYD_RESULT_BROKEN;
+    }
+    if (!FileIo::IsDaemonProcess(pid)) return RELAYD_RESULT_NOT_RUNNING;
     const std::string path = Daemon::GetDebugPath(pid);
     FileLock lock(path.c_str());
     if (!lock.Lock(LOCK_EX)) {
         ZSYSLOG(LOG_INFO, "lock failed");
         return RELAYD_RESULT_BUSY;
     }
-    if (daemon_pid_file_kill(SIGUSR1) < 0) {
+    // The pid checked above, not a second read of the PID file.
+    if (kill(pid, SIGUSR1) != 0) {
         // The empty debug file is left behind on purpose.
         ZSYSLOG(LOG_ERR, "daemon is not running");
         return RELAYD_RESULT_NOT_RUNNING;

@@ -35,7 +35,8 @@ bool FileLock::Lock(int op) {
     if (!Consistent()) return false;
     for (size_t i = 0; i < _files.size(); ++i) {
         if (_fds[i] >= 0) continue;
-        int fd = open(_files[i].c_str(), O_RDWR | O_CREAT | O_NONBLOCK | O_CLOEXEC, 0600);
+        int fd =
+            open(_files[i].c_str(), O_RDWR | O_CREAT | O_NONBLOCK | O_CLOEXEC | O_NOFOLLOW | O_NOCTTY, 0600);
         if (fd < 0) return Fail();
         if (flock(fd, op | LOCK_NB) != 0) {
             int saved = errno;

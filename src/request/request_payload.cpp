@@ -2,14 +2,12 @@
 // description record.
 #define ZEPA_LOG_SOURCE "request"
 
-#include <json/reader.h>
 #include <json/writer.h>
-
-#include <exception>
 
 #include <zeparelayd/errors.h>
 #include <zeparelayd/request.h>
 
+#include "common/file_io.h"
 #include "common/log.h"
 
 namespace ZEPA {
@@ -23,20 +21,12 @@ std::string Serialise(const Json::Value& data) {
 }
 
 bool Parse(const std::string& text, Json::Value& out) {
-    Json::Reader reader;
     Json::Value parsed;
-    bool ok = false;
-    try {
-        ok = reader.parse(text, parsed, false);
-    } catch (const std::exception&) {
-        // The reader throws past its nesting limit: an unreadable answer like any other.
-        ok = false;
-    }
-    if (ok) {
+    if (FileIo::ParseJson(text, parsed)) {
         out.swap(parsed);
         return true;
     }
-    ZLOG(ZEPA_LOG_DEBUG, "failed to parse response: %s", text.c_str());
+    ZLOG(ZEPA_LOG_DEBUG, "failed to parse response: %s", FileIo::ClipForLog(text).c_str());
     return false;
 }
 
@@ -44,8 +34,7 @@ bool Parse(const std::string& text, Json::Value& out) {
 // text as it stands.
 std::string MaskedBody(const std::string& data) {
     Json::Value parsed;
-    Json::Reader reader;
-    if (!data.empty() && (data[0] == '{' || data[0] == '[') && reader.parse(data, parsed, false)) {
+    if (!data.empty() && (data[0] == '{' || data[0] == '[') && FileIo::ParseJson(data, parsed)) {
         const Json::Value masked = MaskSecrets(parsed);
         if (masked == parsed) return data;
         std::string text = Serialise(masked);

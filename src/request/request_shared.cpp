@@ -10,8 +10,10 @@
 
 #include <cstdio>
 #include <cstring>
+#include <exception>
 #include <vector>
 
+#include "common/file_io.h"
 #include "common/log.h"
 #include "request/request_internal.h"
 
@@ -98,7 +100,18 @@ void ReleaseAbandonedShares() {
 size_t WriteResponse(char* ptr, size_t size, size_t count, void* userdata) {
     size_t bytes = size * count;
     if (bytes == 0) return 0;
-    static_cast<std::string*>(userdata)->append(ptr, bytes);
+    std::string* answer = static_cast<std::string*>(userdata);
+    // A longer answer is no answer of ours: taking fewer bytes than offered
+    // ends the transfer with CURLE_WRITE_ERROR, and memory stays bounded.
+    if (bytes > FileIo::MAX_ANSWER_BYTES - answer->size()) {
+        ZLOG(ZEPA_LOG_ERR, "answer longer than %zu bytes refused", FileIo::MAX_ANSWER_BYTES);
+        return 0;
+    }
+    try {
+        answer->append(ptr, bytes);
+    } catch (const std::exception&) {
+        return 0;
+    }
     return bytes;
 }
 

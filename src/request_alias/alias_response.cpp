@@ -2,13 +2,13 @@
 #define ZEPA_LOG_SOURCE "request_alias"
 
 #include <curl/curl.h>
-#include <json/reader.h>
 
 #include <zeparelayd/errors.h>
 #include <zeparelayd/request_alias.h>
 #include <cctype>
 #include <sstream>
 
+#include "common/file_io.h"
 #include "common/log.h"
 #include "request/curl_class.h"
 
@@ -41,8 +41,7 @@ ALIAS_RET AliasResultOf(int code) {
 // A JSON object answer, parsed with comments off.
 bool ParseJsonObject(const std::string& text, Json::Value& out) {
     Json::Value parsed;
-    Json::Reader reader;
-    if (!reader.parse(text, parsed, false) || !parsed.isObject()) return false;
+    if (!FileIo::ParseJson(text, parsed) || !parsed.isObject()) return false;
     out = parsed;
     return true;
 }
@@ -98,7 +97,8 @@ bool ParseHttp(HTTPResponse& r, const std::string& sent, ALIAS_RET& ret, std::st
     g_lastLoggedCurlCode = 0;
 
     AliasRequest::Trim(r.body);
-    ZLOG(ZEPA_LOG_DEBUG, "HTTP: %d, Response: %s", r.httpStatus, MaskAnswer(r.body, sent).c_str());
+    ZLOG(ZEPA_LOG_DEBUG, "HTTP: %d, Response: %s", r.httpStatus,
+         FileIo::ClipForLog(MaskAnswer(r.body, sent)).c_str());
     httpStatus = r.httpStatus;
     if (r.httpStatus == 200) {
         body = r.body;
@@ -171,7 +171,8 @@ bool AliasRequest::GetResponseForDaemon(boost::shared_ptr<Request> req, ALIAS_RE
         return false;
     }
     if (!ParseServerResponse(body, code)) {
-        ZLOG(ZEPA_LOG_ERR, "Unknown response: %s", MaskAnswer(body, req->GetData()).c_str());
+        ZLOG(ZEPA_LOG_ERR, "Unknown response: %s",
+             FileIo::ClipForLog(MaskAnswer(body, req->GetData())).c_str());
         return false;
     }
     const std::string::size_type colon = body.find(':');

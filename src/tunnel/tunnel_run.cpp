@@ -153,15 +153,36 @@ bool Tunnel::RunVPNTunnel(const char* proto) {
     return IsAlive();
 }
 
+namespace {
+
+// A file of ours left by an earlier run (regular, one link, our owner) is
+// replaced; anything else standing at the name is refused with EEXIST.
+int CreatePassFile(const std::string& path) {
+    const int flags = O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC | O_NOCTTY;
+    int fd = g_tunnelFileOps.open(path.c_str(), flags, 0600);
+    if (fd >= 0 || errno != EEXIST) return fd;
+    struct stat st;
+    if (lstat(path.c_str(), &st) != 0 || !S_ISREG(st.st_mode) || st.st_uid != geteuid() || st.st_nlink != 1) {
+        errno = EEXIST;
+        return -1;
+    }
+    if (unlink(path.c_str()) != 0) return -1;
+    return g_tunnelFileOps.open(path.c_str(), flags, 0600);
+}
+
+}  // namespace
+
 // The mode is set on the open descriptor before the secret is written, so
 // that a file left over with a wider mode is narrowed first.
 bool Tunnel::WritePassFile(const std::string& path) const {
-    // O_NOFOLLOW: a link planted under the pass file's name is never written through.
-    FileDescriptor fd(
-        g_tunnelFileOps.open(path.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_NOFOLLOW | O_CLOEXEC, 0600));
+    // Created exclusively: nothing planted under the name (a link, a file
+    // with a second hard link, another user's file) is ever written into.
+    FileDescriptor fd(CreatePassFile(path));
     if (fd.get() < 0) {
-        ZLOG(ZEPA_LOG_ERR, "open [%s] failed, %s", path.c_str(), strerror(errno));
-        unlink(path.c_str());
+        const int openErrno = errno;
+        ZLOG(ZEPA_LOG_ERR, "open [%s] failed, %s", path.c_str(), strerror(openErrno));
+        // What stands at the name is not ours to remove.
+        if (openErrno != EEXIST) unlink(path.c_str());
         return false;
     }
     if (g_tunnelFileOps.fchmod(fd.get(), 0600) != 0) {

@@ -116,7 +116,7 @@ TEST_F(JsonFileTest, WriteIsStyledWithMode0644AndNoTemporaryLeft) {
     ASSERT_TRUE(RelaydConf::WriteJsonFile(path, v));
     EXPECT_EQ("{\n   \"a\" : {\n      \"x\" : \"y\"\n   },\n   \"b\" : [ 1, 2 ]\n}\n", ReadFile(path));
     EXPECT_EQ(0644u, FileMode(path));
-    EXPECT_FALSE(FileExists(path + ".tmp." + std::to_string(getpid())));
+    EXPECT_TRUE(zepatest::TemporariesOf(path).empty());
     Json::Value back;
     ASSERT_TRUE(RelaydConf::ReadJsonFile(path, back));
     EXPECT_EQ(v, back);
@@ -134,7 +134,7 @@ TEST_F(JsonFileTest, WriteIntoMissingDirectoryFailsAtOpen) {
     StderrCapture cap;
     EXPECT_FALSE(RelaydConf::WriteJsonFile(path, Json::Value(1)));
     std::string log = cap.stop();
-    EXPECT_TRUE(LogContains(log, "open failed [" + path + ".tmp." + std::to_string(getpid()) + "]")) << log;
+    EXPECT_TRUE(LogContains(log, "open failed [" + path + ".tmp." + std::to_string(getpid()) + ".")) << log;
 }
 
 TEST_F(JsonFileTest, EmptyPathFailsAtTheOpenEvenInAWritableFolder) {
@@ -158,7 +158,7 @@ TEST_F(JsonFileTest, FailedRenameIsLoggedButReportedTrue) {
     EXPECT_TRUE(RelaydConf::WriteJsonFile(path, Json::Value(1)));
     std::string log = cap.stop();
     EXPECT_TRUE(LogContains(log, "rename to " + path + " failed ")) << log;
-    EXPECT_FALSE(FileExists(path + ".tmp." + std::to_string(getpid())));
+    EXPECT_TRUE(zepatest::TemporariesOf(path).empty());
 }
 
 TEST_F(JsonFileTest, FailedWriteLeavesOldFileWholeAndNoTemporary) {
@@ -173,7 +173,7 @@ TEST_F(JsonFileTest, FailedWriteLeavesOldFileWholeAndNoTemporary) {
         Json::Value big;
         big["data"] = std::string(100000, 'x');
         bool ok = RelaydConf::WriteJsonFile(path, big);
-        bool tmpLeft = FileExists(path + ".tmp." + std::to_string(getpid()));
+        bool tmpLeft = !zepatest::TemporariesOf(path).empty();
         _exit(ok ? 1 : (tmpLeft ? 2 : 0));
     }
     int status = 0;

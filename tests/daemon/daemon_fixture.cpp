@@ -118,11 +118,17 @@ StandInDaemon::StandInDaemon(DumpMode mode) {
     _pid = fork();
     if (_pid == 0) {
         close(fds[0]);
+        // The status readers believe only a process of the daemon's name.
+        prctl(PR_SET_NAME, "zeparelayd");
+        int ready = 0;
+        if (write(fds[1], &ready, sizeof(ready)) != sizeof(ready)) _exit(3);
         StandInLoop(mode, fds[1]);
     }
     sigprocmask(SIG_SETMASK, &old, nullptr);
     close(fds[1]);
     _reports = fds[0];
+    int ready = -1;
+    if (_pid > 0 && read(_reports, &ready, sizeof(ready)) != sizeof(ready)) Stop();
 }
 
 StandInDaemon::~StandInDaemon() {

@@ -1,3 +1,4 @@
+#include <sys/resource.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -21,8 +22,24 @@ protected:
     std::string Conf() const { return root.path(CONF); }
     void WriteConf(const std::string& text) const { root.write(CONF, text); }
     Json::Value ReadConf() const { return zepatest::ParseJson(root.read(CONF)); }
-    // Makes the temporary file of the next write impossible to create.
-    void BlockTheWrite() const { zepatest::MakeDirs(Conf() + ".tmp." + std::to_string(getpid())); }
+    // Makes the next write fail: a file size limit of one byte (root is
+    // bound by it too) stops the temporary file's content; undone in TearDown.
+    void BlockTheWrite() {
+        getrlimit(RLIMIT_FSIZE, &_savedLimit);
+        _limited = true;
+        signal(SIGXFSZ, SIG_IGN);
+        struct rlimit one = {1, _savedLimit.rlim_max};
+        setrlimit(RLIMIT_FSIZE, &one);
+    }
+    void TearDown() override {
+        if (_limited) setrlimit(RLIMIT_FSIZE, &_savedLimit);
+        signal(SIGXFSZ, SIG_DFL);
+        DaemonTest::TearDown();
+    }
+
+private:
+    struct rlimit _savedLimit = {};
+    bool _limited = false;
 };
 
 // ---- VLIBRelaydLogStart ----------------------------------------------------
@@ -76,9 +93,9 @@ TEST_F(EntryPointTest, LogStartOnEmptyCorruptOrNonObjectFilesFails) {
 
 TEST_F(EntryPointTest, LogStartFailsWhenTheFileCannotBeWritten) {
     WriteConf("{\"serverID\": \"abc\"}");
-    BlockTheWrite();
     StandInDaemon daemon;
     WritePidFile(daemon.pid());
+    BlockTheWrite();
     EXPECT_EQ(-1, VLIBRelaydLogStart("/x.log"));
     EXPECT_EQ("{\"serverID\": \"abc\"}", root.read(CONF));
     EXPECT_TRUE(daemon.NothingReported());

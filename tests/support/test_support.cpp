@@ -1,5 +1,6 @@
 #include "support/test_support.h"
 
+#include <dirent.h>
 #include <fcntl.h>
 #include <json/reader.h>
 #include <json/writer.h>
@@ -142,6 +143,48 @@ void WriteFile(const std::string& path, const std::string& content, mode_t mode)
 }
 
 bool FileExists(const std::string& path) { return access(path.c_str(), F_OK) == 0; }
+
+void RemoveWithBad(const std::string& path) {
+    std::string cmd = "rm -rf '" + path + "' '" + path + ".bad'";
+    if (system(cmd.c_str()) != 0) throw std::runtime_error("cannot remove " + path);
+}
+
+bool PlantHostile(const std::string& kind, const std::string& path) {
+    RemoveWithBad(path);
+    if (kind == "fifo") return mkfifo(path.c_str(), 0666) == 0;
+    if (kind == "folder") {
+        MakeDirs(path + "/inside");
+        return true;
+    }
+    if (kind == "device") return symlink("/dev/zero", path.c_str()) == 0;
+    if (kind == "huge") {
+        int fd = open(path.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
+        if (fd < 0) return false;
+        bool ok = ftruncate(fd, 1024L * 1024 * 1024) == 0;
+        close(fd);
+        return ok;
+    }
+    if (kind == "nested") {
+        WriteFile(path, "{\"pid\": 1, \"a\": " + std::string(1001, '[') + std::string(1001, ']') + "}");
+        return true;
+    }
+    return false;
+}
+
+std::vector<std::string> TemporariesOf(const std::string& path) {
+    std::string::size_type slash = path.rfind('/');
+    std::string folder = slash == std::string::npos ? "." : path.substr(0, slash == 0 ? 1 : slash);
+    std::string prefix = (slash == std::string::npos ? path : path.substr(slash + 1)) + ".tmp.";
+    std::vector<std::string> names;
+    DIR* dir = opendir(folder.c_str());
+    if (dir == nullptr) return names;
+    for (dirent* e = readdir(dir); e != nullptr; e = readdir(dir)) {
+        std::string name = e->d_name;
+        if (name.compare(0, prefix.size(), prefix) == 0) names.push_back(name);
+    }
+    closedir(dir);
+    return names;
+}
 
 void MakeDirs(const std::string& path) {
     std::string cur;

@@ -72,6 +72,16 @@ void WriteFile(const std::string& path, const std::string& content, mode_t mode 
 bool FileExists(const std::string& path);
 void MakeDirs(const std::string& path);
 mode_t FileMode(const std::string& path);
+// Names in path's folder that start with path's name + ".tmp.": temporary
+// files of writes to path.
+std::vector<std::string> TemporariesOf(const std::string& path);
+// Puts what a hostile local user might plant at path, after removing what
+// stood there: "fifo", "folder" (not empty), "device" (a link to /dev/zero),
+// "huge" (a sparse 1 GiB file) or "nested" (a JSON object nested 1,001 deep).
+// False for an unknown kind or a failed call.
+bool PlantHostile(const std::string& kind, const std::string& path);
+// rm -rf path and path + ".bad".
+void RemoveWithBad(const std::string& path);
 Json::Value ParseJson(const std::string& text);
 std::string ToJson(const Json::Value& value);
 

@@ -83,10 +83,13 @@ TEST_F(TunnelPassFile, ModeIsNarrowedOnTheOpenFileBeforeAnyByte) {
     Tunnel tunnel = MakeTunnel();
     ASSERT_TRUE(tunnel.WritePassFile(PassPath()));
 
+    // The leftover is replaced by a file created anew: the last open makes
+    // the descriptor that is narrowed and then written.
     ASSERT_GE(g_calls.size(), 3u);
-    EXPECT_EQ("open", g_calls[0]);
-    EXPECT_EQ("fchmod same-fd 384", g_calls[1]);  // 0600
-    EXPECT_EQ("write same-fd mode 384 size-before 0", g_calls[2]);
+    const size_t n = g_calls.size();
+    EXPECT_EQ("open", g_calls[n - 3]);
+    EXPECT_EQ("fchmod same-fd 384", g_calls[n - 2]);  // 0600
+    EXPECT_EQ("write same-fd mode 384 size-before 0", g_calls[n - 1]);
     EXPECT_EQ(0600u, zepatest::FileMode(PassPath()));
     EXPECT_EQ("relayuser\ns3cret-pass", zepatest::ReadFile(PassPath()));
 }
@@ -187,3 +190,48 @@ TEST_F(TunnelPassFile, SectionWithoutPasswordStartsNothing) {
 }
 
 }  // namespace
+
+// A file pre-created under the pass file's name with a second hard link of
+// the planter's: the secret must never reach the planter's link.
+TEST_F(TunnelPassFile, PlantedHardLinkNeverReceivesTheSecret) {
+    root.write("/tmp/planted", "", 0666);
+    ASSERT_EQ(0, link(root.path("/tmp/planted").c_str(), PassPath().c_str()));
+    Tunnel tunnel = MakeTunnel();
+    zepatest::StderrCapture capture;
+    EXPECT_FALSE(tunnel.WritePassFile(PassPath()));
+    const std::string log = capture.stop();
+    EXPECT_EQ("", root.read("/tmp/planted"));
+    EXPECT_TRUE(zepatest::LogContains(log, "open [" + PassPath() + "] failed, File exists")) << log;
+}
+
+TEST_F(TunnelPassFile, FolderAtTheNameIsRefused) {
+    zepatest::MakeDirs(PassPath() + "/inside");
+    Tunnel tunnel = MakeTunnel();
+    zepatest::StderrCapture capture;
+    EXPECT_FALSE(tunnel.WritePassFile(PassPath()));
+    capture.stop();
+    EXPECT_TRUE(zepatest::FileExists(PassPath() + "/inside"));
+}
+
+// A pass file of our own left by an earlier start is replaced by a new one.
+TEST_F(TunnelPassFile, OwnLeftoverIsReplacedWithTheNewSecret) {
+    zepatest::WriteFile(PassPath(), "old\nsecret", 0644);
+    struct stat before;
+    ASSERT_EQ(0, stat(PassPath().c_str(), &before));
+    Tunnel tunnel = MakeTunnel();
+    ASSERT_TRUE(tunnel.WritePassFile(PassPath()));
+    EXPECT_EQ("relayuser\ns3cret-pass", zepatest::ReadFile(PassPath()));
+    EXPECT_EQ(0600u, zepatest::FileMode(PassPath()));
+}
+
+// Run as root: a file of another user at the name is refused untouched.
+TEST_F(TunnelPassFile, AnotherUsersFileIsRefused) {
+    if (geteuid() != 0) GTEST_SKIP() << "needs root to give a file to another user";
+    zepatest::WriteFile(PassPath(), "theirs", 0644);
+    ASSERT_EQ(0, chown(PassPath().c_str(), 65534, 65534));
+    Tunnel tunnel = MakeTunnel();
+    zepatest::StderrCapture capture;
+    EXPECT_FALSE(tunnel.WritePassFile(PassPath()));
+    capture.stop();
+    EXPECT_EQ("theirs", zepatest::ReadFile(PassPath()));
+}
