@@ -11,6 +11,7 @@
 #include "common/log.h"
 #include "common/paths.h"
 #include "debug_dump.h"
+#include "systemd_notify.h"
 
 using namespace ZEPA::Relay;
 
@@ -49,6 +50,7 @@ bool RelayDaemon::Start() {
          _conf->enable ? "enabled" : "disabled");
     SetState(RELAYD_STATE_STARTING, RELAYD_SUCCESS);
     StartRegistration();
+    NotifyReady(ServiceStatusLine(GetStateStr(_state), GetErrorStr(_error), _aliasWord));
     return true;
 }
 
@@ -107,6 +109,7 @@ void RelayDaemon::ReapChildren() {
 }
 
 void RelayDaemon::Shutdown() {
+    NotifyStopping();
     _loop.CancelRequests("register");
     StopAliasCycle();
     RemoveDebugDump();

@@ -19,6 +19,7 @@
 #include "common/paths.h"
 #include "debug_dump.h"
 #include "relay_daemon.h"
+#include "systemd_notify.h"
 
 using namespace ZEPA::Relay;
 
@@ -83,6 +84,7 @@ void RelayDaemon::WriteStatus() {
     status["alias_status"] = _aliasWord;
     if (status == _lastStatus) return;
     if (RelaydConf::WriteJsonFile(Paths::Resolve(Paths::STATUS_FILE), status)) _lastStatus = status;
+    NotifyStatus(ServiceStatusLine(GetStateStr(_state), GetErrorStr(_error), _aliasWord));
 }
 
 Json::Value RelayDaemon::DebugDump() const {
