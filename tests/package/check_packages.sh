@@ -30,10 +30,10 @@ version=$(sed -n 's/^project(zeparelayd VERSION \([0-9.]*\).*/\1/p' "$src/CMakeL
 deb() { ls "$debs/$1"_"$version"-*_*.deb 2>/dev/null | head -n 1; }
 field() { dpkg-deb -f "$(deb "$1")" "$2"; }
 holds() {  # package, path: the package's file list has the path
-  dpkg-deb -c "$(deb "$1")" | awk '{print $6}' | sed 's|^\./|/|' | grep -qx "$2" || fail "$1 does not hold $2"
+  dpkg-deb -c "$(deb "$1")" | awk '{print $6}' | sed 's|^\./|/|' | grep -x "$2" >/dev/null || fail "$1 does not hold $2"
 }
 lacks() {  # package, pattern
-  if dpkg-deb -c "$(deb "$1")" | awk '{print $6}' | grep -q "$2"; then fail "$1 holds $2"; fi
+  if dpkg-deb -c "$(deb "$1")" | awk '{print $6}' | grep "$2" >/dev/null; then fail "$1 holds $2"; fi
 }
 
 echo "== package set and relations"
@@ -42,12 +42,12 @@ for p in libzepasdk1 libzeparelayd1 libzeparelayd-dev zeparelayd; do
   [ "$(field $p Package)" = "$p" ] || fail "$p: wrong Package field"
 done
 full=$(field libzeparelayd1 Version)
-field libzeparelayd1 Depends | grep -q "libzepasdk1 (= $full)" || fail "libzeparelayd1 does not depend on libzepasdk1 $full"
-field libzeparelayd-dev Depends | grep -q "libzeparelayd1 (= $full)" || fail "libzeparelayd-dev does not depend on libzeparelayd1 $full"
-field zeparelayd Depends | grep -q "libzeparelayd1 (= $full)" || fail "zeparelayd does not depend on libzeparelayd1 $full"
+field libzeparelayd1 Depends | grep "libzepasdk1 (= $full)" >/dev/null || fail "libzeparelayd1 does not depend on libzepasdk1 $full"
+field libzeparelayd-dev Depends | grep "libzeparelayd1 (= $full)" >/dev/null || fail "libzeparelayd-dev does not depend on libzeparelayd1 $full"
+field zeparelayd Depends | grep "libzeparelayd1 (= $full)" >/dev/null || fail "zeparelayd does not depend on libzeparelayd1 $full"
 # Dependencies on the distribution's libraries come from the binaries.
-field libzeparelayd1 Depends | grep -q "libjsoncpp" || fail "libzeparelayd1 lacks its jsoncpp dependency"
-dpkg-deb --ctrl-tarfile "$(deb libzeparelayd1)" | tar -xO ./shlibs | grep -qx "libzeparelayd 1 libzeparelayd1 (= $full)" \
+field libzeparelayd1 Depends | grep "libjsoncpp" >/dev/null || fail "libzeparelayd1 lacks its jsoncpp dependency"
+dpkg-deb --ctrl-tarfile "$(deb libzeparelayd1)" | tar -xO ./shlibs | grep -x "libzeparelayd 1 libzeparelayd1 (= $full)" >/dev/null \
   || fail "libzeparelayd1 has no shlibs entry for its SONAME"
 
 echo "== contents"
@@ -68,7 +68,7 @@ for f in /usr/sbin/zeparelayd /usr/bin/zeparelayctl /usr/lib/systemd/system/zepa
          /usr/share/man/man5/zeparelayd.conf.5.gz /usr/share/doc/zeparelayd/examples/zeparelayd.conf; do
   holds zeparelayd "$f"
 done
-dpkg-deb --ctrl-tarfile "$(deb zeparelayd)" | tar -xO ./conffiles | grep -qx /etc/logrotate.d/zeparelayd \
+dpkg-deb --ctrl-tarfile "$(deb zeparelayd)" | tar -xO ./conffiles | grep -x /etc/logrotate.d/zeparelayd >/dev/null \
   || fail "the logrotate file is not a conffile"
 for p in libzepasdk1 libzeparelayd1 libzeparelayd-dev zeparelayd; do
   holds $p "/usr/share/doc/$p/copyright"
@@ -87,8 +87,9 @@ echo "== the installed programs run from there"
 for prog in usr/sbin/zeparelayd usr/bin/zeparelayctl; do
   needed=$(objdump -p "$root/$prog" | awk '/NEEDED/ && /libzep/ {print $2}')
   [ -n "$needed" ] || fail "$prog needs none of the packaged libraries"
+  loaded=$(ldd "$root/$prog")
   for so in $needed; do
-    ldd "$root/$prog" | grep -q "$so => $root/" || { ldd "$root/$prog"; fail "$prog does not load the staged $so"; }
+    grep -qF "$so => $root/" <<<"$loaded" || { echo "$loaded"; fail "$prog does not load the staged $so"; }
   done
 done
 out=$("$root/usr/sbin/zeparelayd" --version)
