@@ -17,11 +17,20 @@ namespace Relay {
 
 class ZEPARELAYD_API Request {
 public:
+    // The URL usually comes from ServerConf::GetUrl(nullptr): the server's own
+    // page ("Serv.php" unless configured); an invalid server gives an empty URL
+    // and so an invalid request (IsValid false, Send fails). A null url leaves
+    // the request invalid too; a null data means an empty body. data is copied.
     Request(const char* url, const char* data, bool post);
     Request(const std::string& url, const Json::Value& data, bool post);
+    // Each request owns its libcurl easy handle, freed by the destructor. A
+    // copy gets a duplicate handle with the same URL and body, ready to be
+    // sent again; the answer, the result and the received cookies are not
+    // copied.
     Request(const Request& other);
     // Does not free the handle held before: only assign to a request without one.
     Request& operator=(const Request& other);
+    // A request added to a multi handle must be removed (JobRemove) first.
     ~Request();
 
     // Find the request that owns a finished easy handle of a multi loop.
@@ -53,7 +62,7 @@ public:
     bool SetTcpKeepAlive(int seconds);
     bool Write(Json::Value& out) const;
     // The easy handle (null when invalid), for callers that tune or inspect
-    // a transfer themselves.
+    // a transfer themselves; it stays the request's: never clean it up.
     CURL* GetCurlHandle() const;
 
     // Process-wide cookie and DNS state.

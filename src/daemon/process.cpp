@@ -105,7 +105,8 @@ bool Daemon::Fork() {
     if (pid > 0) ExitWithStartupWord();
     _isForked = true;
     // A fresh log file per daemon start; without one stderr stays on /dev/null.
-    if (!_strLogFile.empty()) OpenLogFile(_strLogFile, STDERR_FILENO, O_CREAT | O_TRUNC);
+    // Appending keeps lines at the end after logrotate truncates the file.
+    if (!_strLogFile.empty()) OpenLogFile(_strLogFile, STDERR_FILENO, O_CREAT | O_TRUNC | O_APPEND);
     return true;
 }
 

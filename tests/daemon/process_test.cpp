@@ -11,6 +11,7 @@
 #include <csignal>
 #include <cstring>
 #include <string>
+#include <vector>
 
 #include <zeparelayd/daemon.h>
 
@@ -267,6 +268,28 @@ TEST_F(ProcessTest, EachDaemonStartBeginsAFreshLogFile) {
     std::string text = zepatest::ReadFile(logFile);
     EXPECT_EQ(std::string::npos, text.find("old content"));
     EXPECT_TRUE(zepatest::LogContains(text, "test:1 first start"));
+}
+
+// logrotate's copytruncate empties the file under the running daemon: the next
+// line must land at its start, not after a hole as long as the old content.
+TEST_F(ProcessTest, AfterATruncationByAnotherProcessTheNextLineStartsTheFile) {
+    const std::string logFile = root.path("/var/log/custom.log");
+    int launcher = RunInChild([&] {
+        Daemon::SetLogFile(logFile, 4);
+        Daemon::SetName("zeparelayd");
+        if (!Daemon::Init(true)) return 90;
+        Daemon::Log(3, "%s:%d before the rotation", "test", 1);
+        if (truncate(logFile.c_str(), 0) != 0) _exit(91);
+        Daemon::Log(3, "%s:%d after the rotation", "test", 2);
+        _exit(0);
+    });
+    ASSERT_EQ(0, ExitCode(launcher));
+    EXPECT_EQ(0, ExitCode(ReapAll()));
+    std::string text = zepatest::ReadFile(logFile);
+    EXPECT_EQ(std::string::npos, text.find('\0'));
+    std::vector<std::string> lines = zepatest::LogMessages(text);
+    ASSERT_EQ(1u, lines.size()) << text;
+    EXPECT_EQ("test:2 after the rotation", lines[0]);
 }
 
 TEST_F(ProcessTest, WithoutLogFileTheDaemonsStderrStaysOnTheNullDevice) {

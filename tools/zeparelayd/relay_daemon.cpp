@@ -10,6 +10,7 @@
 
 #include "debug_dump.h"
 #include "log.h"
+#include "systemd_notify.h"
 
 using namespace ZEPA::Relay;
 
@@ -47,6 +48,7 @@ bool RelayDaemon::Start() {
          _conf->enable ? "enabled" : "disabled");
     SetState(RELAYD_STATE_STARTING, RELAYD_SUCCESS);
     _registration.Start();
+    NotifyReady(ServiceStatusLine(GetStateStr(_state), GetErrorStr(_error), _alias.Word()));
     return true;
 }
 
@@ -98,6 +100,7 @@ void RelayDaemon::ReapChildren() {
 }
 
 void RelayDaemon::Shutdown() {
+    NotifyStopping();
     _registration.Stop();
     _alias.Stop();
     RemoveDebugDump();

@@ -16,6 +16,7 @@
 #include "debug_dump.h"
 #include "log.h"
 #include "relay_daemon.h"
+#include "systemd_notify.h"
 
 using namespace ZEPA::Relay;
 
@@ -42,6 +43,7 @@ void RelayDaemon::WriteStatus() {
     status["alias_status"] = _alias.Word();
     if (status == _lastStatus) return;
     if (RelaydConf::WriteJsonFile(Daemon::GetStatusPath(), status)) _lastStatus = status;
+    NotifyStatus(ServiceStatusLine(GetStateStr(_state), GetErrorStr(_error), _alias.Word()));
 }
 
 Json::Value RelayDaemon::DebugDump() const {
