@@ -81,9 +81,9 @@ void ParseKvContent(const std::string& content, KvFile& file) {
         KvLine line = ParseKvLine(content.substr(start, end - start), section);
         if (line.kind == KvLine::SECTION) {
             section = line.section;
-            file.sections.insert(section);
+            file.index[section];
         } else if (line.kind == KvLine::ENTRY) {
-            file.firstEntry.emplace(line.section + "\n" + line.key, file.lines.size());
+            file.index[line.section].emplace(line.key, file.lines.size());
         }
         file.lines.push_back(std::move(line));
         start = end + 1;
@@ -91,12 +91,12 @@ void ParseKvContent(const std::string& content, KvFile& file) {
 }
 
 int KvFile::Lookup(const std::string& section, const std::string& key, std::string& value) const {
-    auto it = firstEntry.find(section + "\n" + key);
-    if (it != firstEntry.end()) {
-        value = lines[it->second].value;
-        return 1;
-    }
-    return section.empty() || sections.count(section) != 0 ? 0 : -1;
+    auto sec = index.find(section);
+    if (sec == index.end()) return section.empty() ? 0 : -1;
+    auto entry = sec->second.find(key);
+    if (entry == sec->second.end()) return 0;
+    value = lines[entry->second].value;
+    return 1;
 }
 
 namespace {

@@ -5,7 +5,6 @@
 #include <memory>
 #include <string>
 #include <unordered_map>
-#include <unordered_set>
 #include <vector>
 
 namespace zepasdk {
@@ -21,8 +20,8 @@ struct KvLine {
 // A whole file, with an index so that a look-up does not walk every line.
 struct KvFile {
     std::vector<KvLine> lines;
-    std::unordered_map<std::string, size_t> firstEntry;  // section "\n" key -> line
-    std::unordered_set<std::string> sections;
+    // section -> key -> line of its first entry; every section seen has a slot
+    std::unordered_map<std::string, std::unordered_map<std::string, size_t>> index;
 
     // Finds key in section ("" = before any section). -1: section missing;
     // 0: key missing; 1: found (the first occurrence).
