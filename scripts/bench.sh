@@ -34,7 +34,8 @@ step "Foundation micro-benchmarks"
 if [ ${#smoke[@]} -gt 0 ]; then
   "$build/bench/foundation/bench_foundation" --benchmark_min_time=0.01 >/dev/null || fail "bench_foundation failed"
 else
-  "$build/bench/foundation/bench_foundation" --benchmark_repetitions=3 --benchmark_report_aggregates_only=true \
+  "$build/bench/foundation/bench_foundation" --benchmark_repetitions=3 --benchmark_min_time=0.1 \
+    --benchmark_report_aggregates_only=true \
     || fail "bench_foundation failed"
 fi
 
