@@ -6,9 +6,12 @@
 #include <algorithm>
 #include <cstdlib>
 #include <cstring>
+#include <memory>
 #include <new>
 #include <string>
 #include <vector>
+
+#include "kv_file.h"
 
 namespace {
 
@@ -34,7 +37,7 @@ bool ListDefinitionFiles(const std::string& dir, std::vector<std::string>& files
         if (!EndsWith(name, ".conf")) continue;
         std::string full = dir + "/" + name;
         struct stat st;
-        if (stat(full.c_str(), &st) != 0 || !S_ISREG(st.st_mode)) continue;
+        if (ent->d_type != DT_REG && (stat(full.c_str(), &st) != 0 || !S_ISREG(st.st_mode))) continue;
         files.push_back(full);
     }
     closedir(d);
@@ -42,10 +45,12 @@ bool ListDefinitionFiles(const std::string& dir, std::vector<std::string>& files
     return true;
 }
 
-std::string ReadKey(const std::string& file, const char* key) {
-    char buf[kValueMax] = {0};
-    if (VLIBCFileGetKeyValue(file.c_str(), key, buf, sizeof(buf)) <= 0) return "";
-    return buf;
+// A top-level value as VLIBCFileGetKeyValue gives it (cut to kValueMax - 1).
+std::string ReadKey(const zepasdk::KvFile& file, const char* key) {
+    std::string value;
+    if (file.Lookup("", key, value) != 1) return "";
+    if (value.size() >= static_cast<size_t>(kValueMax)) value.resize(kValueMax - 1);
+    return value.c_str();
 }
 
 // Copies text into a fixed array; false when it does not fit.
@@ -74,8 +79,12 @@ bool ReadPorts(const std::string& text, PVLIBCSzList* ports) {
 
 // One definition file as a record; NULL when it is no definition or on memory
 // shortage (outOfMemory tells which).
-PZEPAFwService ReadDefinition(const std::string& file, bool& outOfMemory) {
+PZEPAFwService ReadDefinition(const std::string& path, bool& outOfMemory) {
     outOfMemory = false;
+    // One parse per file, not one per key.
+    std::shared_ptr<const zepasdk::KvFile> parsed = zepasdk::LoadKvFile(path);
+    if (!parsed) return nullptr;
+    const zepasdk::KvFile& file = *parsed;
     std::string name = ReadKey(file, "name");
     if (name.empty()) return nullptr;
     PZEPAFwService rec = static_cast<PZEPAFwService>(calloc(1, sizeof(ZEPAFwService)));

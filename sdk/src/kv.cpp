@@ -2,6 +2,7 @@
 #include <strings.h>
 
 #include <cstring>
+#include <memory>
 #include <string>
 #include <vector>
 
@@ -26,27 +27,13 @@ int CopyOut(const std::string& value, char* buf, int size) {
     return static_cast<int>(n);
 }
 
-// Finds key in section ("" = before any section). -1: section missing; 0: key
-// missing; 1: found.
-int Lookup(const std::vector<KvLine>& lines, const char* section, const char* key, std::string& value) {
-    bool sectionSeen = section[0] == '\0';
-    for (const KvLine& l : lines) {
-        if (l.kind == KvLine::SECTION && l.section == section) sectionSeen = true;
-        if (l.kind == KvLine::ENTRY && l.section == section && l.key == key) {
-            value = l.value;
-            return 1;
-        }
-    }
-    return sectionSeen ? 0 : -1;
-}
-
 int GetValue(const char* file, const char* section, const char* key, char* buf, int size) {
     if (file == nullptr || key == nullptr || buf == nullptr || size < 1) return Fail(ZEPA_ERR_BAD_PARAMETERS);
     buf[0] = '\0';
-    std::vector<KvLine> lines;
-    if (!zepasdk::ReadKvFile(file, lines)) return Fail(ZEPA_ERR_FILE_NOT_FOUND);
+    std::shared_ptr<const zepasdk::KvFile> parsed = zepasdk::LoadKvFile(file);
+    if (!parsed) return Fail(ZEPA_ERR_FILE_NOT_FOUND);
     std::string value;
-    int found = Lookup(lines, section, key, value);
+    int found = parsed->Lookup(section, key, value);
     if (found < 0) return Fail(ZEPA_ERR_SECTION_NOT_FOUND);
     if (found == 0) {
         VLIBCErrSet(ZEPA_ERR_KEY_NOT_FOUND);
@@ -115,9 +102,9 @@ int VLIBCFileGetSectionValue(const char* file, const char* section, const char* 
 
 int VLIBCFileCheckKeyValue(const char* file, const char* key, const char* value, int opt) {
     if (file == nullptr || key == nullptr || value == nullptr) return Fail(ZEPA_ERR_BAD_PARAMETERS);
-    std::vector<KvLine> lines;
+    std::shared_ptr<const zepasdk::KvFile> parsed = zepasdk::LoadKvFile(file);
     std::string current;
-    bool found = zepasdk::ReadKvFile(file, lines) && Lookup(lines, "", key, current) == 1;
+    bool found = parsed && parsed->Lookup("", key, current) == 1;
     if (!found) {
         VLIBCErrSet(ZEPA_ERR_KEY_NOT_FOUND);
         return (opt & 1) ? 1 : 0;
@@ -144,10 +131,10 @@ int VLIBCINFOSetKeyValue(const char* key, const char* value) {
 
 int VLIBCFileEnumSection(const char* file, PVLIBCSzList* list) {
     if (file == nullptr || list == nullptr || *list == nullptr) return Fail(ZEPA_ERR_BAD_PARAMETERS);
-    std::vector<KvLine> lines;
-    if (!zepasdk::ReadKvFile(file, lines)) return Fail(ZEPA_ERR_FILE_NOT_FOUND);
+    std::shared_ptr<const zepasdk::KvFile> parsed = zepasdk::LoadKvFile(file);
+    if (!parsed) return Fail(ZEPA_ERR_FILE_NOT_FOUND);
     int count = 0;
-    for (const KvLine& l : lines) {
+    for (const KvLine& l : parsed->lines) {
         if (l.kind != KvLine::SECTION) continue;
         if (VLIBCSzListPush(list, l.section.c_str()) != 0) return -1;
         ++count;

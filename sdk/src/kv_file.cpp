@@ -4,8 +4,10 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <cerrno>
 #include <cstdio>
-#include <fstream>
+#include <ctime>
+#include <mutex>
 
 namespace zepasdk {
 
@@ -69,17 +71,171 @@ KvLine ParseKvLine(const std::string& text, const std::string& currentSection) {
     return line;
 }
 
+void ParseKvContent(const std::string& content, KvFile& file) {
+    file = KvFile();
+    std::string section;
+    size_t start = 0;
+    while (start < content.size()) {
+        size_t end = content.find('\n', start);
+        if (end == std::string::npos) end = content.size();
+        KvLine line = ParseKvLine(content.substr(start, end - start), section);
+        if (line.kind == KvLine::SECTION) {
+            section = line.section;
+            file.index[section];
+        } else if (line.kind == KvLine::ENTRY) {
+            file.index[line.section].emplace(line.key, file.lines.size());
+        }
+        file.lines.push_back(std::move(line));
+        start = end + 1;
+    }
+}
+
+int KvFile::Lookup(const std::string& section, const std::string& key, std::string& value) const {
+    auto sec = index.find(section);
+    if (sec == index.end()) return section.empty() ? 0 : -1;
+    auto entry = sec->second.find(key);
+    if (entry == sec->second.end()) return 0;
+    value = lines[entry->second].value;
+    return 1;
+}
+
+namespace {
+
+// Bigger files are parsed on every call rather than kept.
+const off_t kCacheFileMax = 8 << 20;
+const size_t kCacheEntries = 32;
+// A file modified this recently may be rewritten again within the same time
+// stamp (coarse clocks, file systems with 1 or 2 s granularity): compare its
+// content before trusting what is kept.
+const long long kRacyNs = 2000000000LL;
+
+long long Ns(const struct timespec& t) { return t.tv_sec * 1000000000LL + t.tv_nsec; }
+
+long long NowNs() {
+    struct timespec t;
+    clock_gettime(CLOCK_REALTIME, &t);
+    return Ns(t);
+}
+
+struct Identity {
+    dev_t dev;
+    ino_t ino;
+    off_t size;
+    long long mtime;
+    long long ctime;
+
+    explicit Identity(const struct stat& st)
+        : dev(st.st_dev), ino(st.st_ino), size(st.st_size), mtime(Ns(st.st_mtim)), ctime(Ns(st.st_ctim)) {}
+    bool operator==(const Identity& o) const {
+        return dev == o.dev && ino == o.ino && size == o.size && mtime == o.mtime && ctime == o.ctime;
+    }
+};
+
+struct CachedFile {
+    Identity id;
+    std::string content;  // kept only while the entry is racy
+    long long readAt;     // when the content was last read (taken before the read)
+    unsigned long long lastUse;
+    std::shared_ptr<const KvFile> parsed;
+
+    bool Racy() const { return readAt - id.mtime < kRacyNs; }
+};
+
+std::mutex g_cacheLock;
+std::unordered_map<std::string, CachedFile> g_cache;
+unsigned long long g_useCounter = 0;
+
+// Reads a regular file whole; false when it cannot be opened or read, or is
+// something else (a FIFO would block, a device never ends).
+bool ReadRegularFile(const std::string& path, std::string& content, struct stat& st) {
+    int fd = open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK | O_NOCTTY);
+    if (fd < 0) return false;
+    bool ok = fstat(fd, &st) == 0 && S_ISREG(st.st_mode);
+    content.clear();
+    if (ok && st.st_size > 0) content.reserve(static_cast<size_t>(st.st_size));
+    char buf[65536];
+    while (ok) {
+        ssize_t n = read(fd, buf, sizeof(buf));
+        if (n == 0) break;
+        if (n < 0) {
+            if (errno != EINTR) ok = false;
+            continue;
+        }
+        content.append(buf, static_cast<size_t>(n));
+    }
+    close(fd);
+    return ok;
+}
+
+void EvictOldest() {
+    auto oldest = g_cache.begin();
+    for (auto it = g_cache.begin(); it != g_cache.end(); ++it) {
+        if (it->second.lastUse < oldest->second.lastUse) oldest = it;
+    }
+    if (oldest != g_cache.end()) g_cache.erase(oldest);
+}
+
+// The kept parse when the file is unchanged; null otherwise.
+std::shared_ptr<const KvFile> Kept(const std::string& path, const struct stat& st) {
+    auto it = g_cache.find(path);
+    if (it == g_cache.end()) return nullptr;
+    CachedFile& entry = it->second;
+    if (!(entry.id == Identity(st))) {
+        g_cache.erase(it);
+        return nullptr;
+    }
+    if (entry.Racy()) {
+        long long readAt = NowNs();
+        std::string content;
+        struct stat now;
+        if (!ReadRegularFile(path, content, now) || !(Identity(now) == entry.id) ||
+            content != entry.content) {
+            g_cache.erase(it);
+            return nullptr;
+        }
+        entry.readAt = readAt;
+        if (!entry.Racy()) entry.content.clear();
+    }
+    entry.lastUse = ++g_useCounter;
+    return entry.parsed;
+}
+
+}  // namespace
+
+std::shared_ptr<const KvFile> LoadKvFile(const std::string& path) {
+    std::lock_guard<std::mutex> guard(g_cacheLock);
+    struct stat st;
+    if (stat(path.c_str(), &st) != 0) {
+        g_cache.erase(path);
+        return nullptr;
+    }
+    if (std::shared_ptr<const KvFile> kept = Kept(path, st)) return kept;
+
+    long long readAt = NowNs();
+    std::string content;
+    if (!ReadRegularFile(path, content, st)) return nullptr;
+    auto parsed = std::make_shared<KvFile>();
+    ParseKvContent(content, *parsed);
+    if (st.st_size <= kCacheFileMax) {
+        if (g_cache.size() >= kCacheEntries) EvictOldest();
+        CachedFile entry{Identity(st), std::move(content), readAt, ++g_useCounter, parsed};
+        if (!entry.Racy()) entry.content.clear();
+        g_cache.erase(path);
+        g_cache.emplace(path, std::move(entry));
+    }
+    return parsed;
+}
+
+void ForgetKvFile(const std::string& path) {
+    std::lock_guard<std::mutex> guard(g_cacheLock);
+    g_cache.erase(path);
+}
+
 bool ReadKvFile(const std::string& path, std::vector<KvLine>& lines) {
     lines.clear();
-    std::ifstream in(path);
-    if (!in.is_open()) return false;
-    std::string text;
-    std::string section;
-    while (std::getline(in, text)) {
-        KvLine line = ParseKvLine(text, section);
-        if (line.kind == KvLine::SECTION) section = line.section;
-        lines.push_back(line);
-    }
+    std::shared_ptr<const KvFile> file = LoadKvFile(path);
+    if (!file) return false;
+    lines = file->lines;
     return true;
 }
 
@@ -115,6 +271,7 @@ bool WriteKvFile(const std::string& path, const std::vector<KvLine>& lines) {
     if (close(fd) != 0) ok = false;
     if (ok && rename(tmp.c_str(), path.c_str()) != 0) ok = false;
     if (!ok) unlink(tmp.c_str());
+    ForgetKvFile(path);
     return ok;
 }
 

@@ -15,32 +15,35 @@ bool IsServiceName(const char* name) {
     return strcmp(name, ".") != 0 && strcmp(name, "..") != 0;
 }
 
-std::string Trim(const std::string& s) {
-    size_t b = s.find_first_not_of(" \t");
-    if (b == std::string::npos) return "";
-    size_t e = s.find_last_not_of(" \t");
-    return s.substr(b, e - b + 1);
+// Pointer ranges rather than strings: router rule files hold thousands of
+// port lists, each parsed once per service looked up.
+void TrimRange(const char*& b, const char*& e) {
+    while (b < e && (*b == ' ' || *b == '\t')) ++b;
+    while (e > b && (e[-1] == ' ' || e[-1] == '\t')) --e;
 }
 
 // A port of decimal digits only, 0 to 65535.
-bool ParsePort(const std::string& text, long& port) {
-    std::string t = Trim(text);
-    if (t.empty() || t.size() > 5) return false;
-    for (char c : t)
-        if (!isdigit(static_cast<unsigned char>(c))) return false;
-    port = strtol(t.c_str(), nullptr, 10);
+bool ParsePort(const char* b, const char* e, long& port) {
+    TrimRange(b, e);
+    if (b == e || e - b > 5) return false;
+    long value = 0;
+    for (const char* p = b; p < e; ++p) {
+        if (!isdigit(static_cast<unsigned char>(*p))) return false;
+        value = value * 10 + (*p - '0');
+    }
+    port = value;
     return port <= kPortMax;
 }
 
 // One item: "port" or "low-high".
-bool ParseItem(const std::string& item, long& low, long& high) {
-    size_t dash = item.find('-');
-    if (dash == std::string::npos) {
-        if (!ParsePort(item, low)) return false;
+bool ParseItem(const char* b, const char* e, long& low, long& high) {
+    const char* dash = static_cast<const char*>(memchr(b, '-', static_cast<size_t>(e - b)));
+    if (dash == nullptr) {
+        if (!ParsePort(b, e, low)) return false;
         high = low;
         return true;
     }
-    return ParsePort(item.substr(0, dash), low) && ParsePort(item.substr(dash + 1), high) && low <= high;
+    return ParsePort(b, dash, low) && ParsePort(dash + 1, e, high) && low <= high;
 }
 
 }  // namespace
@@ -78,14 +81,13 @@ int VLibParsePorts(const char* szPorts, int* piPorts, int nMax) {
         VLIBCErrSet(ZEPA_ERR_BAD_PARAMETERS);
         return -1;
     }
-    std::string text = szPorts;
+    const char* end = szPorts + strlen(szPorts);
     long count = 0;
-    size_t start = 0;
-    while (start <= text.size()) {
-        size_t comma = text.find(',', start);
-        if (comma == std::string::npos) comma = text.size();
+    for (const char* start = szPorts;;) {
+        const char* comma = static_cast<const char*>(memchr(start, ',', static_cast<size_t>(end - start)));
+        if (comma == nullptr) comma = end;
         long low = 0, high = 0;
-        if (!ParseItem(text.substr(start, comma - start), low, high)) {
+        if (!ParseItem(start, comma, low, high)) {
             VLIBCErrSet(ZEPA_ERR_PARSE);
             return -1;
         }
@@ -97,6 +99,7 @@ int VLibParsePorts(const char* szPorts, int* piPorts, int nMax) {
             }
             piPorts[count] = static_cast<int>(port);
         }
+        if (comma == end) break;
         start = comma + 1;
     }
     VLIBCErrSet(ZEPA_ERR_NONE);

@@ -2,6 +2,7 @@
 #define ZEPA_LOG_SOURCE "daemon"
 
 #include <json/writer.h>
+#include <unistd.h>
 
 #include <iostream>
 #include <string>
@@ -22,18 +23,31 @@ namespace {
 
 void PrintLine(const char* label, const std::string& value) { std::cout << label << value << std::endl; }
 
+// The alias name as a RelaydConf built from confPath would hold it. Only the
+// alias section is read: a whole configuration re-derives every service's
+// ports from the system (firewall definitions, router rules), which a status
+// line does not show and which grows with the router rules.
+std::string AliasNameOf(const std::string& confPath) {
+    AliasConf alias;
+    Json::Value value;
+    const bool existed = access(confPath.c_str(), F_OK) == 0;
+    if (!RelaydConf::ReadJsonFile(confPath, value)) return alias.GetAliasName();
+    // A corrupt file is set aside by the reader and counts as no configuration.
+    if (existed && access(confPath.c_str(), F_OK) != 0) return alias.GetAliasName();
+    if (value.isObject() && value.isMember("server_alias")) alias.Overwrite(value["server_alias"]);
+    return alias.GetAliasName();
+}
+
 }  // namespace
 
 int PrintStatusReport() {
     AliasStatus aliasStatus;
-    const std::string confPath = Paths::Resolve(Paths::RELAYD_CONF);
-    RelaydConf conf(confPath.c_str());
+    const std::string aliasName = AliasNameOf(Paths::Resolve(Paths::RELAYD_CONF));
     std::string serverId, state, error;
     if (!Daemon::GetStatus(serverId, state, error, nullptr)) {
         std::cout << "get status failed" << std::endl;
         return RELAYD_RESULT_UNAVAILABLE;
     }
-    const std::string aliasName = conf.alias.GetAliasName();
     std::string aliasWord, unused;
     aliasStatus.GetStatus(aliasName, aliasWord, unused);
     PrintLine("serverID: ", serverId);

@@ -171,6 +171,12 @@ bool Request::SetUpHandle() {
 // own verify callback accepts every chain; both settings are kept as they are.
 bool Request::SetUpHttps() {
     REQUEST_SETOPT_OR_FAIL(CURLOPT_SSL_CTX_FUNCTION, RequestInternal::SetUpSslContext);
+    // The same trust anchors, parsed once per process instead of per connection.
+    if (void* mark = RequestInternal::SharedTrustStoreMark()) {
+        REQUEST_SETOPT_OR_FAIL(CURLOPT_SSL_CTX_DATA, mark);
+        REQUEST_SETOPT_OR_FAIL(CURLOPT_CAINFO, static_cast<char*>(nullptr));
+        REQUEST_SETOPT_OR_FAIL(CURLOPT_CAPATH, static_cast<char*>(nullptr));
+    }
     curl_easy_setopt(_curl, CURLOPT_SSL_VERIFYPEER, 1L);
     curl_easy_setopt(_curl, CURLOPT_SSL_VERIFYHOST, 2L);
     return true;

@@ -5,7 +5,9 @@
 #include <arpa/inet.h>
 #include <netinet/in.h>
 #include <openssl/ssl.h>
+#include <openssl/x509_vfy.h>
 #include <resolv.h>
+#include <sys/stat.h>
 #include <zeparelayd/request.h>
 
 #include <cstdio>
@@ -83,6 +85,93 @@ std::string CookieHostOf(const std::string& url) {
 
 int AcceptEveryCertificate(int /*preverified*/, X509_STORE_CTX* /*ctx*/) { return 1; }
 
+// What a trust file was when it was loaded; a change of any field reloads it.
+struct FileStamp {
+    bool exists = false;
+    dev_t dev = 0;
+    ino_t ino = 0;
+    off_t size = 0;
+    struct timespec mtime = {0, 0};
+    struct timespec ctime = {0, 0};
+
+    static FileStamp Of(const std::string& path) {
+        FileStamp stamp;
+        struct stat st;
+        if (path.empty() || stat(path.c_str(), &st) != 0) return stamp;
+        stamp.exists = true;
+        stamp.dev = st.st_dev;
+        stamp.ino = st.st_ino;
+        stamp.size = st.st_size;
+        stamp.mtime = st.st_mtim;
+        stamp.ctime = st.st_ctim;
+        return stamp;
+    }
+    bool operator==(const FileStamp& o) const {
+        return exists == o.exists && dev == o.dev && ino == o.ino && size == o.size &&
+               mtime.tv_sec == o.mtime.tv_sec && mtime.tv_nsec == o.mtime.tv_nsec &&
+               ctime.tv_sec == o.ctime.tv_sec && ctime.tv_nsec == o.ctime.tv_nsec;
+    }
+};
+
+// The trust store of every "https://" connection: libcurl's default bundle
+// and folder plus the extra CA file. Parsing the system bundle costs far more
+// than a loopback exchange, so it is loaded once and shared by the SSL
+// contexts (reference counted), and reloaded when a file changes.
+struct TrustStore {
+    X509_STORE* store = nullptr;
+    bool extraFailed = false;
+    std::string bundle;
+    std::string folder;
+    std::string extra;
+    FileStamp bundleStamp;
+    FileStamp extraStamp;
+};
+
+TrustStore g_trust;
+
+void DefaultTrustLocations(std::string& bundle, std::string& folder) {
+    const curl_version_info_data* info = curl_version_info(CURLVERSION_NOW);
+    bundle = info != nullptr && info->cainfo != nullptr ? info->cainfo : "";
+    folder = info != nullptr && info->capath != nullptr ? info->capath : "";
+}
+
+// Builds the store as libcurl would for a verifying connection; null when the
+// bundle cannot be loaded (the caller then leaves libcurl to report it).
+X509_STORE* BuildTrustStore(const std::string& bundle, const std::string& folder, const std::string& extra,
+                            bool& extraFailed) {
+    X509_STORE* store = X509_STORE_new();
+    if (store == nullptr) return nullptr;
+    if ((!bundle.empty() && X509_STORE_load_file(store, bundle.c_str()) != 1) ||
+        (!folder.empty() && X509_STORE_load_path(store, folder.c_str()) != 1)) {
+        X509_STORE_free(store);
+        return nullptr;
+    }
+    X509_STORE_set_flags(store, X509_V_FLAG_TRUSTED_FIRST | X509_V_FLAG_PARTIAL_CHAIN);
+    extraFailed = !extra.empty() && X509_STORE_load_file(store, extra.c_str()) != 1;
+    return store;
+}
+
+// The current shared store, reloaded when a trust file changed; null when it
+// cannot be built.
+X509_STORE* CurrentTrustStore() {
+    std::string bundle, folder;
+    DefaultTrustLocations(bundle, folder);
+    FileStamp bundleStamp = FileStamp::Of(bundle);
+    FileStamp extraStamp = FileStamp::Of(g_extraCaFile);
+    TrustStore& t = g_trust;
+    if (t.store != nullptr && t.bundle == bundle && t.folder == folder && t.extra == g_extraCaFile &&
+        t.bundleStamp == bundleStamp && t.extraStamp == extraStamp)
+        return t.store;
+    X509_STORE_free(t.store);
+    t.store = BuildTrustStore(bundle, folder, g_extraCaFile, t.extraFailed);
+    t.bundle = bundle;
+    t.folder = folder;
+    t.extra = g_extraCaFile;
+    t.bundleStamp = bundleStamp;
+    t.extraStamp = extraStamp;
+    return t.store;
+}
+
 }  // namespace
 
 namespace RequestInternal {
@@ -115,9 +204,19 @@ size_t WriteResponse(char* ptr, size_t size, size_t count, void* userdata) {
     return bytes;
 }
 
-CURLcode SetUpSslContext(CURL* /*curl*/, void* sslctx, void* /*userdata*/) {
+void* SharedTrustStoreMark() { return CurrentTrustStore() != nullptr ? &g_trust : nullptr; }
+
+CURLcode SetUpSslContext(CURL* /*curl*/, void* sslctx, void* userdata) {
     SSL_CTX* ctx = static_cast<SSL_CTX*>(sslctx);
     SSL_CTX_set_verify(ctx, SSL_VERIFY_CLIENT_ONCE, AcceptEveryCertificate);
+    if (userdata == &g_trust) {
+        X509_STORE* store = CurrentTrustStore();
+        if (store == nullptr) return CURLE_SSL_CACERT_BADFILE;
+        SSL_CTX_set1_cert_store(ctx, store);
+        if (g_trust.extraFailed)
+            ZLOG(ZEPA_LOG_WARNING, "load extra CA file [%s] failed", g_extraCaFile.c_str());
+        return CURLE_OK;
+    }
     if (!g_extraCaFile.empty() && SSL_CTX_load_verify_locations(ctx, g_extraCaFile.c_str(), nullptr) != 1) {
         ZLOG(ZEPA_LOG_WARNING, "load extra CA file [%s] failed", g_extraCaFile.c_str());
     }

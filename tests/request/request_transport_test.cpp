@@ -360,6 +360,33 @@ TEST_F(RequestTransport, HttpsToAnUnknownCaIsRejectedDespiteTheAcceptingCallback
     EXPECT_EQ(0u, server.requests().size());
 }
 
+// The trust store is kept between connections: it must follow both the
+// choice of the extra CA file and a new content at the same path.
+TEST_F(RequestTransport, TrustFollowsTheExtraCaFileAndItsContent) {
+    zepatest::LocalServer other;
+    ASSERT_TRUE(other.ok()) << other.error();
+    auto sendTo = [](const zepatest::LocalServer& to) {
+        Request request(to.httpsUrl("/test/json").c_str(), "", false);
+        request.Send();
+        return request.GetCurlResult();
+    };
+    EXPECT_EQ(CURLE_OK, sendTo(server));
+    EXPECT_EQ(CURLE_PEER_FAILED_VERIFICATION, sendTo(other));
+
+    Request::SetExtraCaFile(other.caFile());
+    EXPECT_EQ(CURLE_OK, sendTo(other));
+    EXPECT_EQ(CURLE_PEER_FAILED_VERIFICATION, sendTo(server));
+
+    const std::string ca = root.path("/etc/extra-ca.pem");
+    root.write("/etc/extra-ca.pem", zepatest::ReadFile(other.caFile()));
+    Request::SetExtraCaFile(ca);
+    EXPECT_EQ(CURLE_OK, sendTo(other));
+    zepatest::WriteFile(ca + ".new", zepatest::ReadFile(server.caFile()));
+    ASSERT_EQ(0, rename((ca + ".new").c_str(), ca.c_str()));
+    EXPECT_EQ(CURLE_OK, sendTo(server));
+    EXPECT_EQ(CURLE_PEER_FAILED_VERIFICATION, sendTo(other));
+}
+
 TEST_F(RequestTransport, UpperCaseHttpsGetsNoContextCallback) {
     // Without the callback the test CA is never added, so the system's trust
     // store alone decides, and it does not know the throwaway CA.

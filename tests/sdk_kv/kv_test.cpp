@@ -1,5 +1,7 @@
+#include <fcntl.h>
 #include <gtest/gtest.h>
 #include <sys/stat.h>
+#include <unistd.h>
 #include <zepasdk/kv.h>
 #include <zepasdk/sysroot.h>
 
@@ -11,6 +13,7 @@
 using zepatest::FileMode;
 using zepatest::ReadFile;
 using zepatest::RootTest;
+using zepatest::WriteFile;
 
 namespace {
 
@@ -197,6 +200,109 @@ TEST_F(KvTest, WriteLeavesNoTemporaryFile) {
     while (fgets(line, sizeof(line), p)) listing += line;
     pclose(p);
     EXPECT_EQ(".\n..\ntest.conf\n", listing);
+}
+
+// Parsed files are kept between calls: every kind of rewrite must be seen.
+class KvRewriteTest : public KvTest {
+protected:
+    // Overwrites the file where it is (same inode).
+    static void rewriteInPlace(const std::string& path, const std::string& content) {
+        int fd = open(path.c_str(), O_WRONLY | O_TRUNC);
+        ASSERT_GE(fd, 0);
+        ASSERT_EQ(static_cast<ssize_t>(content.size()), write(fd, content.data(), content.size()));
+        close(fd);
+    }
+    // Replaces the file by a new one (new inode), as editors and our writer do.
+    static void rewriteByRename(const std::string& path, const std::string& content) {
+        WriteFile(path + ".new", content);
+        ASSERT_EQ(0, rename((path + ".new").c_str(), path.c_str()));
+    }
+};
+
+TEST_F(KvRewriteTest, SameSizeRewriteInPlaceIsSeenAtOnce) {
+    std::string f = file("k=\"aaa\"\n");
+    EXPECT_EQ("aaa", get(f, "k"));
+    rewriteInPlace(f, "k=\"bbb\"\n");
+    EXPECT_EQ("bbb", get(f, "k"));
+    rewriteInPlace(f, "k=\"ccc\"\n");
+    EXPECT_EQ("ccc", get(f, "k"));
+}
+
+TEST_F(KvRewriteTest, SameSizeRewriteInPlaceWithOldTimeRestoredIsSeen) {
+    std::string f = file("k=\"aaa\"\n");
+    struct timespec old[2] = {{1000000000, 0}, {1000000000, 0}};
+    ASSERT_EQ(0, utimensat(AT_FDCWD, f.c_str(), old, 0));
+    EXPECT_EQ("aaa", get(f, "k"));
+    rewriteInPlace(f, "k=\"bbb\"\n");
+    ASSERT_EQ(0, utimensat(AT_FDCWD, f.c_str(), old, 0));
+    EXPECT_EQ("bbb", get(f, "k"));
+}
+
+TEST_F(KvRewriteTest, ReplacementByRenameIsSeen) {
+    std::string f = file("k=\"aaa\"\n");
+    EXPECT_EQ("aaa", get(f, "k"));
+    rewriteByRename(f, "k=\"bbb\"\n");
+    EXPECT_EQ("bbb", get(f, "k"));
+}
+
+TEST_F(KvRewriteTest, GrownFileShowsNewSectionsAndKeys) {
+    std::string f = file("[r1]\ns_port=\"1\"\n");
+    PVLIBCSzList list = VLIBCSzListAlloc(4);
+    ASSERT_NE(nullptr, list);
+    EXPECT_EQ(1, VLIBCFileEnumSection(f.c_str(), &list));
+    VLIBCSzListFree(list);
+    char buf[16];
+    EXPECT_EQ(-1, VLIBCFileGetSectionValue(f.c_str(), "r2", "s_port", buf, sizeof(buf)));
+
+    WriteFile(f, "[r1]\ns_port=\"1\"\n[r2]\ns_port=\"22\"\n");
+    list = VLIBCSzListAlloc(4);
+    ASSERT_NE(nullptr, list);
+    EXPECT_EQ(2, VLIBCFileEnumSection(f.c_str(), &list));
+    VLIBCSzListFree(list);
+    EXPECT_EQ(2, VLIBCFileGetSectionValue(f.c_str(), "r2", "s_port", buf, sizeof(buf)));
+    EXPECT_STREQ("22", buf);
+}
+
+TEST_F(KvRewriteTest, RemovedFileIsMissingAndRecreatedOneIsRead) {
+    std::string f = file("k=\"aaa\"\n");
+    EXPECT_EQ("aaa", get(f, "k"));
+    ASSERT_EQ(0, unlink(f.c_str()));
+    get(f, "k");
+    EXPECT_EQ(-1, last);
+    EXPECT_EQ(ZEPA_ERR_FILE_NOT_FOUND, VLIBCErrGet());
+    EXPECT_EQ(0, VLIBCFileCheckKeyValue(f.c_str(), "k", "aaa", 0));
+    WriteFile(f, "k=\"ddd\"\n");
+    EXPECT_EQ("ddd", get(f, "k"));
+    EXPECT_EQ(1, VLIBCFileCheckKeyValue(f.c_str(), "k", "ddd", 0));
+}
+
+TEST_F(KvRewriteTest, OwnWriteIsSeenByTheNextRead) {
+    std::string f = file("k=\"aaa\"\n");
+    EXPECT_EQ("aaa", get(f, "k"));
+    ASSERT_EQ(0, VLIBCFileSetKeyValue(f.c_str(), "k", "bbb"));
+    EXPECT_EQ("bbb", get(f, "k"));
+    EXPECT_EQ(1, VLIBCFileCheckKeyValue(f.c_str(), "k", "BBB", 0));
+}
+
+TEST_F(KvRewriteTest, ManyFilesReadInTurnKeepTheirOwnValues) {
+    const int kFiles = 80;
+    for (int round = 0; round < 2; ++round) {
+        for (int i = 0; i < kFiles; ++i) {
+            std::string name = "/etc/many" + std::to_string(i) + ".conf";
+            if (round == 0) root.write(name, "k=\"" + std::to_string(i) + "\"\n");
+            EXPECT_EQ(std::to_string(i), get(root.path(name), "k"));
+        }
+    }
+}
+
+TEST_F(KvRewriteTest, FileReplacedByFifoIsRefusedWithoutBlocking) {
+    std::string f = file("k=\"aaa\"\n");
+    EXPECT_EQ("aaa", get(f, "k"));
+    ASSERT_EQ(0, unlink(f.c_str()));
+    ASSERT_EQ(0, mkfifo(f.c_str(), 0644));
+    get(f, "k");
+    EXPECT_EQ(-1, last);
+    EXPECT_EQ(ZEPA_ERR_FILE_NOT_FOUND, VLIBCErrGet());
 }
 
 TEST(SzList, GrowsBeyondItsCapacity) {

@@ -258,6 +258,9 @@ class Handler(BaseHTTPRequestHandler):
     protocol_version = "HTTP/1.1"
     server_version = "ZepaLocal/1.0"
     scheme = "http"
+    # Headers and body go out in separate writes: without TCP_NODELAY the body
+    # waits for the client's delayed ACK (about 40 ms per answer).
+    disable_nagle_algorithm = True
 
     def log_message(self, fmt, *args):
         if self.server.app.verbose:
