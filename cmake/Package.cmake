@@ -96,7 +96,8 @@ libzepasdk gives the relay daemon library the appliance's system facts
 Linux system, below a configurable system root.")
 
 set(CPACK_DEBIAN_RUNTIME_PACKAGE_NAME libzeparelayd1)
-set(CPACK_DEBIAN_RUNTIME_PACKAGE_DEPENDS "libzepasdk1 ${ZEPA_DEB_EXACT}")
+# libcurl is loaded on the first request (dlopen), so shlibdeps cannot see it: name it here.
+set(CPACK_DEBIAN_RUNTIME_PACKAGE_DEPENDS "libzepasdk1 ${ZEPA_DEB_EXACT}, libcurl4")
 set(CPACK_DEBIAN_RUNTIME_DESCRIPTION "relay daemon library of a NAS appliance
 libzeparelayd holds what the relay daemon and the appliance's
 administration tools share: the relay configuration and its JSON files,
