@@ -56,7 +56,7 @@ pid_t IdleChild(int& release) {
     fflush(nullptr);
     pid_t pid = fork();
     if (pid == 0) {
-        close(release);
+        close(fds[1]);
         char c;
         ssize_t unused = read(fds[0], &c, 1);
         (void)unused;
