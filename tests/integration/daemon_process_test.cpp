@@ -646,13 +646,10 @@ TEST_F(DaemonProcess, ADaemonDoesNotStartOnABrokenConfiguration) {
 
 // Reopening the log after rotation touches nothing else: no new registration.
 TEST_F(DaemonProcess, ReopenLogStartsANewFileWithoutReRegistering) {
+    WriteConfig(6);  // the reopening is logged at info level
     ASSERT_EQ(0, StartDaemon());
     ASSERT_TRUE(StatusHas("alias_status: good"));
-    WriteConfig(6);
-    ASSERT_EQ(0, Ctl({"reload"}));
     const std::string log = root.path("/var/log/zeparelayd.log");
-    ASSERT_TRUE(WaitUntil([&] { return Dump()["log_level"].asInt() == 6; }));
-    ASSERT_TRUE(StatusHas("state: connected"));
     const int regs = Requests("/Serv.php");
     const int aliases = Requests("/alias_update.php");
     ASSERT_EQ(0, rename(log.c_str(), (log + ".1").c_str()));
