@@ -39,6 +39,13 @@ cleanup() {
   local rc=$?
   trap - EXIT INT TERM
   trap '' INT TERM
+  # The shell may leave through "set -e" (a child killed by the signal) before
+  # its INT trap runs: the status tells either way.
+  if [ "$rc" -eq 130 ] || [ "$rc" -eq 143 ]; then
+    echo
+    echo "interrupted"
+    rc=130
+  fi
   if [ -f "$stage/var/run/zeparelayd.pid" ]; then
     local pid
     pid=$(cat "$stage/var/run/zeparelayd.pid" 2>/dev/null || true)
@@ -59,11 +66,7 @@ cleanup() {
   wait 2>/dev/null || true
   exit "$rc"
 }
-interrupted() {
-  echo
-  echo "interrupted"
-  exit 130
-}
+interrupted() { exit 130; }
 trap cleanup EXIT
 trap interrupted INT TERM
 

@@ -5,6 +5,7 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <cstdio>
 #include <cstring>
 
 #include <json/reader.h>
@@ -158,6 +159,14 @@ ConfigCheck CheckConfigFile(const std::string& path) {
         checker.CheckSections();
     }
     return result;
+}
+
+bool ReportConfigCheck(const char* program, const std::string& path) {
+    const ConfigCheck check = CheckConfigFile(path);
+    for (const std::string& w : check.warnings) fprintf(stderr, "%s: warning: %s\n", program, w.c_str());
+    for (const std::string& e : check.errors) fprintf(stderr, "%s: %s\n", program, e.c_str());
+    if (check.ok()) printf("%s: configuration OK\n", path.c_str());
+    return check.ok();
 }
 
 }  // namespace zepatools

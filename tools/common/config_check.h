@@ -23,6 +23,11 @@ struct ConfigCheck {
 // Reads path (a regular file of at most 1 MiB) and checks it.
 ConfigCheck CheckConfigFile(const std::string& path);
 
+// "check-config" of both programs: warnings and errors on standard error,
+// each after "program: ", "FILE: configuration OK" on standard output.
+// Whether the file is usable.
+bool ReportConfigCheck(const char* program, const std::string& path);
+
 }  // namespace zepatools
 
 #endif

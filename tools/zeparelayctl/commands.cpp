@@ -209,15 +209,19 @@ int ServerId(const Args& args, const Options&) {
     return EXIT_OK;
 }
 
-int UpdateAlias(const Args& args, const Options&) {
-    if (!args.empty()) return EXIT_USAGE;
+// A signal that asks the running daemon for one thing; says it was sent.
+int Ask(int sig, const char* done) {
     PidFileState daemon;
-    if (SignalDaemon(SIGRTMIN + 1, daemon) != EXIT_OK) {
+    if (SignalDaemon(sig, daemon) != EXIT_OK) {
         SayNotRunning(daemon, stderr);
         return EXIT_NOT_RUNNING;
     }
-    printf("alias update requested\n");
+    printf("%s\n", done);
     return EXIT_OK;
+}
+
+int UpdateAlias(const Args& args, const Options&) {
+    return args.empty() ? Ask(SIGRTMIN + 1, "alias update requested") : EXIT_USAGE;
 }
 
 int ReloadCmd(const Args& args, const Options&) {
@@ -232,25 +236,12 @@ int ReloadCmd(const Args& args, const Options&) {
 }
 
 int ReopenLog(const Args& args, const Options&) {
-    if (!args.empty()) return EXIT_USAGE;
-    PidFileState daemon;
-    if (SignalDaemon(SIGRTMIN + 2, daemon) != EXIT_OK) {
-        SayNotRunning(daemon, stderr);
-        return EXIT_NOT_RUNNING;
-    }
-    printf("the daemon reopens its log file\n");
-    return EXIT_OK;
+    return args.empty() ? Ask(SIGRTMIN + 2, "the daemon reopens its log file") : EXIT_USAGE;
 }
 
 int CheckConfig(const Args& args, const Options&) {
     if (args.size() > 1) return EXIT_USAGE;
-    const std::string path = args.empty() ? ConfPath() : args[0];
-    const ConfigCheck check = CheckConfigFile(path);
-    for (const std::string& w : check.warnings) fprintf(stderr, "zeparelayctl: warning: %s\n", w.c_str());
-    for (const std::string& e : check.errors) fprintf(stderr, "zeparelayctl: %s\n", e.c_str());
-    if (!check.ok()) return EXIT_CONFIG;
-    printf("%s: configuration OK\n", path.c_str());
-    return EXIT_OK;
+    return ReportConfigCheck("zeparelayctl", args.empty() ? ConfPath() : args[0]) ? EXIT_OK : EXIT_CONFIG;
 }
 
 // Waits (bounded) until the process is gone.

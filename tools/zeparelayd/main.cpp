@@ -123,15 +123,6 @@ bool Absolute(const char* option, std::string& path) {
     return true;
 }
 
-int CheckConfig(const std::string& path) {
-    const ConfigCheck check = CheckConfigFile(path);
-    for (const std::string& w : check.warnings) fprintf(stderr, "zeparelayd: warning: %s\n", w.c_str());
-    for (const std::string& e : check.errors) fprintf(stderr, "zeparelayd: %s\n", e.c_str());
-    if (!check.ok()) return EXIT_CONFIG;
-    printf("%s: configuration OK\n", path.c_str());
-    return EXIT_OK;
-}
-
 // A PID file naming a process that is not a zeparelayd (left by a crash, its
 // number since reused) would make the start fail: it is removed instead.
 void RemoveStalePidFile() {
@@ -163,7 +154,9 @@ int main(int argc, char** argv) {
     const std::string confPath = Daemon::GetConfPath();
     if (opt.checkConfig) {
         Daemon::_logLevel = -1;  // the check speaks for itself, on standard error
-        return CheckConfig(opt.checkFile.empty() ? confPath : opt.checkFile);
+        return ReportConfigCheck("zeparelayd", opt.checkFile.empty() ? confPath : opt.checkFile)
+                   ? EXIT_OK
+                   : EXIT_CONFIG;
     }
     // A broken file would be set aside as ".bad" by the library and the
     // daemon would run on defaults: the operator fixes it first.
