@@ -5,28 +5,51 @@
 # zeparelayd against it and drives it with zeparelayctl.
 #
 #   ./scripts/demo.sh            (as root on a fresh machine: installs packages first)
+#   ZEPA_DEMO_BUILD=DIR ZEPA_DEMO_PREBUILT=1 ./scripts/demo.sh
+#                                (use the programs already built in DIR)
 #
-# Everything it starts is stopped again on exit, also on Ctrl-C.
+# Everything it starts is stopped again on exit, also on Ctrl-C, which ends
+# it at once ("interrupted", exit status 130).
 set -euo pipefail
 
 src=$(cd "$(dirname "$0")/.." && pwd)
 build=${ZEPA_DEMO_BUILD:-$src/build-demo}
-stage=$build/demo-root
+stage=${ZEPA_DEMO_STAGE:-$build/demo-root}
 bin_d=$build/tools/zeparelayd/zeparelayd
 bin_c=$build/tools/zeparelayctl/zeparelayctl
 server_pid=""
 
-step() { printf '\n\033[1m==> %s\033[0m\n' "$*"; }
+# Colour only for a terminal.
+if [ -t 1 ]; then bold=$'\033[1m' plain=$'\033[0m'; else bold="" plain=""; fi
+step() { printf '\n%s==> %s%s\n' "$bold" "$*" "$plain"; }
 say() { printf '    %s\n' "$*"; }
 ctl() { "$bin_c" --root "$stage" "$@"; }
 
+# Python helpers die of SIGINT like any program, without a traceback.
+py() {
+  local code=$1
+  shift
+  python3 -c "import signal; signal.signal(signal.SIGINT, signal.SIG_DFL)
+$code" "$@"
+}
+
+# Stops what the demo started: the daemon (only when its PID file names a
+# zeparelayd), the local server and any child still running.
 cleanup() {
   local rc=$?
   trap - EXIT INT TERM
+  trap '' INT TERM
+  # The shell may leave through "set -e" (a child killed by the signal) before
+  # its INT trap runs: the status tells either way.
+  if [ "$rc" -eq 130 ] || [ "$rc" -eq 143 ]; then
+    echo
+    echo "interrupted"
+    rc=130
+  fi
   if [ -f "$stage/var/run/zeparelayd.pid" ]; then
     local pid
     pid=$(cat "$stage/var/run/zeparelayd.pid" 2>/dev/null || true)
-    if [ -n "$pid" ] && kill -0 "$pid" 2>/dev/null; then
+    if [ -n "$pid" ] && [ "$(cat "/proc/$pid/comm" 2>/dev/null)" = zeparelayd ]; then
       kill -TERM "$pid" 2>/dev/null || true
       for _ in $(seq 50); do kill -0 "$pid" 2>/dev/null || break; sleep 0.1; done
       kill -KILL "$pid" 2>/dev/null || true
@@ -36,10 +59,16 @@ cleanup() {
     kill -TERM "$server_pid" 2>/dev/null || true
     wait "$server_pid" 2>/dev/null || true
   fi
+  local child
+  for child in $(cat /proc/$$/task/*/children 2>/dev/null); do
+    kill -TERM "$child" 2>/dev/null || true
+  done
+  wait 2>/dev/null || true
   exit "$rc"
 }
+interrupted() { exit 130; }
 trap cleanup EXIT
-trap 'echo; echo "interrupted"; exit 130' INT TERM
+trap interrupted INT TERM
 
 # Polls a command until its output contains a text (bounded wait).
 wait_for() { # seconds text command...
@@ -54,17 +83,52 @@ wait_for() { # seconds text command...
 }
 
 alias_requests() {
-  python3 -c 'import json,sys,urllib.request as u; print(len(json.load(u.urlopen(
+  py 'import json,sys,urllib.request as u; print(len(json.load(u.urlopen(
     "http://127.0.0.1:%s/_control/requests?path=/alias_update.php" % sys.argv[1]))["requests"]))' "$http_port"
 }
 
-step "1. Dependencies (Debian packages)"
-"$src/scripts/install-deps.sh"
+# The debug dump for people: times as durations, absent values left out.
+show_dump() {
+  py '
+import json, sys, time
+def duration(ms):
+    if ms < 0: return "none"
+    s = ms / 1000.0
+    if s < 60: return "%.1f s" % s
+    m, s = divmod(int(s), 60)
+    if m < 60: return "%d min %d s" % (m, s)
+    h, m = divmod(m, 60)
+    return "%d h %d min" % (h, m)
+def tidy(v):
+    if isinstance(v, dict):
+        out = {}
+        for k, x in v.items():
+            if isinstance(x, int) and not isinstance(x, bool) and k.endswith("_ms"):
+                out[k[:-3]] = duration(x)
+            elif k == "rendered_at" and isinstance(x, int):
+                out["rendered"] = duration((time.time() - x) * 1000) + " ago"
+            elif isinstance(x, int) and not isinstance(x, bool) and x == -1:
+                continue
+            else:
+                out[k] = tidy(x)
+        return out
+    if isinstance(v, list): return [tidy(x) for x in v]
+    return v
+print(json.dumps(tidy(json.load(sys.stdin)), indent=3))'
+}
 
-step "2. Build (library, daemon, control tool) in $build"
-cmake -S "$src" -B "$build" -G Ninja -DCMAKE_BUILD_TYPE=RelWithDebInfo \
-  -DZEPA_BUILD_TESTS=OFF -DZEPA_BUILD_BENCH=OFF >/dev/null
-ninja -C "$build" zeparelayd_daemon zeparelayctl
+if [ -n "${ZEPA_DEMO_PREBUILT:-}" ]; then
+  step "1-2. Programs already built in $build"
+  [ -x "$bin_d" ] && [ -x "$bin_c" ] || { echo "demo: no zeparelayd/zeparelayctl in $build" >&2; exit 1; }
+else
+  step "1. Dependencies (Debian packages)"
+  "$src/scripts/install-deps.sh"
+
+  step "2. Build (library, daemon, control tool) in $build"
+  cmake -S "$src" -B "$build" -G Ninja -DCMAKE_BUILD_TYPE=RelWithDebInfo \
+    -DZEPA_BUILD_TESTS=OFF -DZEPA_BUILD_BENCH=OFF >/dev/null
+  ninja -C "$build" zeparelayd_daemon zeparelayctl
+fi
 
 step "3. A sample appliance in a staging root"
 rm -rf "$stage"
@@ -78,7 +142,7 @@ python3 "$src/tools/localserver/zepa_localserver.py" --ready-file "$stage/tmp/se
 server_pid=$!
 for _ in $(seq 100); do [ -f "$stage/tmp/server.json" ] && break; sleep 0.1; done
 [ -f "$stage/tmp/server.json" ] || { echo "demo: the local server did not start" >&2; exit 1; }
-read -r http_port https_port ca_file < <(python3 -c \
+read -r http_port https_port ca_file < <(py \
   'import json,sys; d=json.load(open(sys.argv[1])); print(d["http_port"], d["https_port"], d["ca_file"])' \
   "$stage/tmp/server.json")
 say "control server https://127.0.0.1:$https_port/Serv.php, alias server https://127.0.0.1:$https_port"
@@ -123,7 +187,16 @@ for _ in $(seq 100); do [ "$(alias_requests)" -gt "$before" ] && break; sleep 0.
 say "alias requests seen by the server: $before before, $(alias_requests) after"
 
 step "9. The debug dump (SIGUSR1; written within milliseconds)"
-ctl status --debug | python3 -m json.tool | sed 's/^/      /'
+# A busy machine may keep the daemon from answering within the query's few
+# milliseconds (exit status 11): asking again is what any caller does.
+dump=""
+for _ in $(seq 20); do
+  if dump=$(ctl status --debug); then break; fi
+  dump=""
+  sleep 0.1
+done
+[ -n "$dump" ] || { echo "demo: the daemon gave no debug dump" >&2; exit 1; }
+printf '%s\n' "$dump" | show_dump | sed 's/^/      /'
 
 step "10. Switch the relay off, then on again"
 ctl disable | sed 's/^/      /'

@@ -11,6 +11,7 @@
 #include <cstdlib>
 #include <fstream>
 #include <functional>
+#include <regex>
 #include <sstream>
 #include <thread>
 
@@ -28,13 +29,16 @@ const std::string kCtl = ZEPA_BINARY_DIR "/tools/zeparelayctl/zeparelayctl";
 const std::string kStage = ZEPA_SOURCE_DIR "/scripts/stage_appliance.sh";
 
 // Runs a program, waits for it and gives its exit status (-1 when it did not
-// exit normally); its standard output goes to out.
-int RunProgram(const std::vector<std::string>& args, std::string* out = nullptr) {
+// exit normally); its standard output goes to out, its standard error to err.
+int RunProgram(const std::vector<std::string>& args, std::string* out = nullptr, std::string* err = nullptr) {
     char tmpl[] = "/tmp/zepa_it_outXXXXXX";
     int fd = mkstemp(tmpl);
+    char errTmpl[] = "/tmp/zepa_it_errXXXXXX";
+    int errFd = mkstemp(errTmpl);
     pid_t pid = fork();
     if (pid == 0) {
         dup2(fd, 1);
+        if (err != nullptr) dup2(errFd, 2);
         std::vector<char*> argv;
         for (const std::string& a : args) argv.push_back(const_cast<char*>(a.c_str()));
         argv.push_back(nullptr);
@@ -44,8 +48,11 @@ int RunProgram(const std::vector<std::string>& args, std::string* out = nullptr)
     int status = 0;
     waitpid(pid, &status, 0);
     close(fd);
+    close(errFd);
     if (out != nullptr) *out = zepatest::ReadFile(tmpl);
+    if (err != nullptr) *err = zepatest::ReadFile(errTmpl);
     unlink(tmpl);
+    unlink(errTmpl);
     return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
 }
 
@@ -120,10 +127,10 @@ protected:
 
     int StartDaemon() { return RunProgram({kDaemon, "--root", root.dir(), "--ca-file", server.caFile()}); }
 
-    int Ctl(const std::vector<std::string>& args, std::string* out = nullptr) {
+    int Ctl(const std::vector<std::string>& args, std::string* out = nullptr, std::string* err = nullptr) {
         std::vector<std::string> all = {kCtl, "--root", root.dir()};
         all.insert(all.end(), args.begin(), args.end());
-        return RunProgram(all, out);
+        return RunProgram(all, out, err);
     }
 
     std::string CtlStatus() {
@@ -194,7 +201,7 @@ TEST_F(DaemonProcess, StartsRegistersAndMapsItsAlias) {
 TEST_F(DaemonProcess, SecondStartIsRefused) {
     ASSERT_EQ(0, StartDaemon());
     pid_t pid = DaemonPid();
-    EXPECT_EQ(1, StartDaemon());
+    EXPECT_EQ(7, StartDaemon());  // a daemon already runs
     EXPECT_TRUE(Alive(pid));
     EXPECT_EQ(pid, DaemonPid());
 }
@@ -334,7 +341,10 @@ TEST_F(DaemonProcess, StopsCleanly) {
     EXPECT_EQ(8, file["state"].asInt());
     EXPECT_EQ(pid, file["pid"].asInt());
     EXPECT_EQ(1, Ctl({"status"}));
-    EXPECT_EQ(1, Ctl({"stop"}));
+    // Stopping what does not run is done already.
+    std::string out;
+    EXPECT_EQ(0, Ctl({"stop"}, &out));
+    EXPECT_EQ("not running\n", out);
 }
 
 // Tools signal the daemon as soon as its PID file appears ("reload",
@@ -463,10 +473,10 @@ TEST_F(DaemonProcess, AControlServerThatKeepsMovingIsFollowedWithBackoff) {
 // The control tool without a daemon: usage, help on every level, exit statuses.
 class ControlTool : public zepatest::RootTest {
 protected:
-    int Ctl(const std::vector<std::string>& args, std::string* out = nullptr) {
+    int Ctl(const std::vector<std::string>& args, std::string* out = nullptr, std::string* err = nullptr) {
         std::vector<std::string> all = {kCtl, "--root", root.dir()};
         all.insert(all.end(), args.begin(), args.end());
-        return RunProgram(all, out);
+        return RunProgram(all, out, err);
     }
 };
 
@@ -486,10 +496,13 @@ TEST_F(ControlTool, HelpOnEveryLevel) {
 TEST_F(ControlTool, BadUsageExits64) {
     EXPECT_EQ(64, RunProgram({kCtl}));
     EXPECT_EQ(64, Ctl({"frobnicate"}));
-    EXPECT_EQ(64, Ctl({"status", "--verbose"}));
+    EXPECT_EQ(64, Ctl({"status", "--bogus"}));
+    EXPECT_EQ(64, Ctl({"reload", "--json"}));
     EXPECT_EQ(64, Ctl({"start-log"}));
     EXPECT_EQ(64, RunProgram({kCtl, "--root", "relative/dir", "status"}));
-    EXPECT_EQ(2, RunProgram({kDaemon, "--bogus"}));
+    // One code for bad usage in both programs.
+    EXPECT_EQ(64, RunProgram({kDaemon, "--bogus"}));
+    EXPECT_EQ(64, RunProgram({kDaemon, "extra"}));
 }
 
 TEST_F(ControlTool, WithoutADaemon) {
@@ -498,7 +511,7 @@ TEST_F(ControlTool, WithoutADaemon) {
     EXPECT_NE(std::string::npos, out.find("state: not_running"));
     EXPECT_EQ(1, Ctl({"status", "--debug"}, &out));
     EXPECT_EQ(1, Ctl({"update-alias"}));
-    EXPECT_EQ(1, Ctl({"stop"}));
+    EXPECT_EQ(0, Ctl({"stop"}));
     EXPECT_EQ(1, Ctl({"reload"}));
     // No configuration file: nothing to read the server id from.
     EXPECT_EQ(5, Ctl({"server-id"}));
@@ -509,4 +522,208 @@ TEST_F(ControlTool, WithoutADaemon) {
     EXPECT_EQ(0, Ctl({"server-id", "nos"}, &out));
     EXPECT_EQ(6, Ctl({"server-id", "photo_http"}, &out));
     EXPECT_EQ("--\n", out);
+}
+
+namespace {
+
+// A process that is not ours, for PID files left behind by a crash.
+class Bystander {
+public:
+    Bystander() {
+        pid = fork();
+        if (pid == 0) {
+            execl("/bin/sleep", "sleep", "100", static_cast<char*>(nullptr));
+            _exit(127);
+        }
+    }
+    ~Bystander() {
+        if (pid > 0) {
+            kill(pid, SIGKILL);
+            waitpid(pid, nullptr, 0);
+        }
+    }
+    pid_t pid;
+};
+
+// Neither tool signals a process that a stale PID file names; the daemon
+// starts over such a file.
+TEST_F(DaemonProcess, AStalePidFileNamingAnotherProcessIsLeftAlone) {
+    Bystander sleeper;
+    ASSERT_GT(sleeper.pid, 0);
+    ASSERT_TRUE(WaitUntil(
+        [&] { return zepatest::ReadFile("/proc/" + std::to_string(sleeper.pid) + "/comm") == "sleep\n"; }));
+    root.write("/var/run/zeparelayd.pid", std::to_string(sleeper.pid) + "\n");
+
+    std::string out, err;
+    EXPECT_EQ(1, Ctl({"status"}, &out));
+    EXPECT_NE(std::string::npos, out.find("state: not_running")) << out;
+    EXPECT_EQ(0, Ctl({"stop"}, &out));
+    EXPECT_EQ("not running (stale PID file)\n", out);
+    EXPECT_EQ(1, Ctl({"reload"}, &out, &err));
+    EXPECT_NE(std::string::npos, err.find("not running (stale PID file)")) << err;
+    EXPECT_EQ(1, Ctl({"update-alias"}, &out, &err));
+    EXPECT_EQ(1, Ctl({"reopen-log"}, &out, &err));
+    EXPECT_EQ(1, Ctl({"status", "--debug"}, &out, &err));
+    EXPECT_TRUE(Alive(sleeper.pid));
+
+    ASSERT_EQ(0, StartDaemon());
+    const pid_t pid = DaemonPid();
+    EXPECT_NE(sleeper.pid, pid);
+    EXPECT_TRUE(Alive(pid));
+    ASSERT_TRUE(StatusHas("state: connected"));
+    EXPECT_EQ(0, Ctl({"stop"}, &out));
+    EXPECT_EQ("daemon stopped\n", out);
+    EXPECT_FALSE(Alive(pid));
+    EXPECT_TRUE(Alive(sleeper.pid));
+}
+
+const char kConfPath[] = "/usr/zepa/etc/zeparelayd/zeparelayd.conf";
+
+// "FILE:LINE:COLUMN: " for the configuration file, where its parse failed.
+bool NamesLineAndColumn(const std::string& text) {
+    return std::regex_search(text, std::regex("zeparelayd\\.conf:[0-9]+:[0-9]+: [A-Z]"));
+}
+
+// A typo in the configuration: the tools name it and send nothing, and a
+// daemon that is told to reload anyway keeps its last good configuration
+// and the operator's file.
+TEST_F(DaemonProcess, ABrokenConfigurationIsRefusedAndTheLastGoodOneKept) {
+    ASSERT_EQ(0, StartDaemon());
+    ASSERT_TRUE(StatusHas("alias_status: good"));
+    const pid_t pid = DaemonPid();
+    const int regs = Requests("/Serv.php");
+    std::string good = root.read(kConfPath);
+    // The alias loses its closing quote.
+    std::string broken = good;
+    const size_t cut = broken.find("\"it-box\"");
+    ASSERT_NE(std::string::npos, cut);
+    broken.replace(cut, 8, "\"it-box");
+    root.write(kConfPath, broken);
+
+    std::string out, err;
+    EXPECT_EQ(5, Ctl({"check-config"}, &out, &err));
+    EXPECT_TRUE(NamesLineAndColumn(err)) << err;
+    EXPECT_EQ(5, RunProgram({kDaemon, "--root", root.dir(), "--check-config"}, &out, &err));
+    EXPECT_TRUE(NamesLineAndColumn(err)) << err;
+    for (const char* cmd : {"reload", "enable", "disable"}) {
+        EXPECT_EQ(5, Ctl({cmd}, &out, &err)) << cmd;
+        EXPECT_TRUE(NamesLineAndColumn(err)) << cmd << ": " << err;
+        EXPECT_EQ(broken, root.read(kConfPath)) << cmd;
+    }
+    // The daemon itself, told directly.
+    ASSERT_EQ(0, kill(pid, SIGHUP));
+    ASSERT_TRUE(StatusHas("error: err_config"));
+    EXPECT_EQ(broken, root.read(kConfPath));
+    EXPECT_FALSE(root.exists(std::string(kConfPath) + ".bad"));
+    const std::string status = CtlStatus();
+    EXPECT_NE(std::string::npos, status.find("alias: it-box")) << status;
+    EXPECT_TRUE(NamesLineAndColumn(status)) << status;
+    EXPECT_TRUE(NamesLineAndColumn(StatusFile()["config_error"].asString()));
+    EXPECT_EQ("it-box", Dump()["config"]["server_alias"]["alias"].asString());
+    EXPECT_TRUE(Alive(pid));
+    EXPECT_EQ(regs, Requests("/Serv.php"));  // nothing was re-registered
+
+    // Fixed: the reload goes through and the error is gone.
+    root.write(kConfPath, good);
+    EXPECT_EQ(0, Ctl({"check-config"}, &out));
+    EXPECT_EQ(0, Ctl({"reload"}));
+    ASSERT_TRUE(WaitUntil([&] { return !StatusFile().isMember("config_error"); }));
+    ASSERT_TRUE(StatusHas("state: connected"));
+}
+
+TEST_F(DaemonProcess, ADaemonDoesNotStartOnABrokenConfiguration) {
+    root.write(kConfPath, "{\n  \"serverID\": 12,\n  \"service\": [}\n");
+    std::string out, err;
+    EXPECT_EQ(5, RunProgram({kDaemon, "--root", root.dir()}, &out, &err));
+    EXPECT_NE(std::string::npos, err.find(root.path(kConfPath) + ":3:")) << err;
+    EXPECT_FALSE(root.exists("/var/run/zeparelayd.pid"));
+    EXPECT_TRUE(root.exists(kConfPath));
+    // Valid JSON with a key of the wrong type is named at that key.
+    root.write(kConfPath, "{\n  \"serverID\": 12\n}\n");
+    EXPECT_EQ(5, Ctl({"check-config"}, &out, &err));
+    EXPECT_NE(std::string::npos, err.find(":2:15: \"serverID\" must be a string")) << err;
+}
+
+// Reopening the log after rotation touches nothing else: no new registration.
+TEST_F(DaemonProcess, ReopenLogStartsANewFileWithoutReRegistering) {
+    WriteConfig(6);  // the reopening is logged at info level
+    ASSERT_EQ(0, StartDaemon());
+    ASSERT_TRUE(StatusHas("alias_status: good"));
+    const std::string log = root.path("/var/log/zeparelayd.log");
+    const int regs = Requests("/Serv.php");
+    const int aliases = Requests("/alias_update.php");
+    ASSERT_EQ(0, rename(log.c_str(), (log + ".1").c_str()));
+    std::string out;
+    EXPECT_EQ(0, Ctl({"reopen-log"}, &out));
+    ASSERT_TRUE(
+        WaitUntil([&] { return zepatest::LogContains(zepatest::ReadFile(log), "log file reopened"); }));
+    EXPECT_FALSE(zepatest::LogContains(zepatest::ReadFile(log), "reloading configuration"));
+    EXPECT_EQ(regs, Requests("/Serv.php"));
+    EXPECT_EQ(aliases, Requests("/alias_update.php"));
+    EXPECT_NE(std::string::npos, CtlStatus().find("state: connected"));
+}
+
+// status --json: one object with the documented members and the exit
+// statuses of "status"; options may follow the command.
+TEST_F(DaemonProcess, StatusAsJsonForScripts) {
+    std::string out;
+    EXPECT_EQ(1, RunProgram({kCtl, "status", "--json", "--root", root.dir()}, &out));
+    Json::Value stopped = zepatest::ParseJson(out);
+    EXPECT_EQ("not_running", stopped["state"].asString());
+    EXPECT_TRUE(stopped["pid"].isNull());
+    EXPECT_EQ("it-box", stopped["alias"].asString());
+
+    ASSERT_EQ(0, StartDaemon());
+    ASSERT_TRUE(StatusHas("alias_status: good"));
+    EXPECT_EQ(0, RunProgram({kCtl, "status", "--root", root.dir(), "--json"}, &out));
+    Json::Value running = zepatest::ParseJson(out);
+    EXPECT_EQ("connected", running["state"].asString());
+    EXPECT_EQ("success", running["error"].asString());
+    EXPECT_EQ(StatusFile()["serverID"].asString(), running["serverID"].asString());
+    EXPECT_FALSE(running["serverID"].asString().empty());
+    EXPECT_EQ("it-box", running["alias"].asString());
+    EXPECT_EQ("good", running["alias_status"].asString());
+    EXPECT_EQ(DaemonPid(), running["pid"].asInt());
+    ASSERT_EQ(2u, running["services"].size());
+    EXPECT_EQ("nos", running["services"][0].asString());
+    EXPECT_EQ(0, RunProgram({kCtl, "status", "--quiet", "--root", root.dir()}, &out));
+    EXPECT_EQ("", out);
+
+    root.write("/tmp/.zeparelayd.status", "{broken");
+    EXPECT_EQ(2, Ctl({"status", "--json"}, &out));
+    EXPECT_TRUE(zepatest::ParseJson(out)["state"].isNull());
+}
+
+}  // namespace
+
+// What the tool prints is its own: no library log lines, no pid of its own
+// passed off as the daemon's, paths named in messages.
+TEST_F(ControlTool, OutputIsTheToolsOwn) {
+    std::string out, err;
+    // No configuration: the library logs that it keeps its defaults.
+    EXPECT_EQ(0, Ctl({"services"}, &out, &err));
+    EXPECT_EQ(std::string::npos, err.find("config:")) << err;
+    EXPECT_EQ(std::string::npos, out.find("config:")) << out;
+    EXPECT_EQ(0, Ctl({"config"}, &out, &err));
+    EXPECT_FALSE(zepatest::ParseJson(out).isMember("pid")) << out;
+    EXPECT_EQ(std::string::npos, err.find("config:")) << err;
+
+    EXPECT_EQ(64, RunProgram({kDaemon, "--root", "/nonexistent-zepa-root"}, &out, &err));
+    EXPECT_NE(std::string::npos, err.find("/nonexistent-zepa-root: No such file or directory")) << err;
+    // Both programs print the same exit status table.
+    std::string ctlHelp, daemonHelp;
+    EXPECT_EQ(0, RunProgram({kCtl, "--help"}, &ctlHelp));
+    EXPECT_EQ(0, RunProgram({kDaemon, "--help"}, &daemonHelp));
+    const size_t table = ctlHelp.find("Exit status (zeparelayd and zeparelayctl):");
+    ASSERT_NE(std::string::npos, table);
+    EXPECT_NE(std::string::npos, daemonHelp.find(ctlHelp.substr(table)));
+}
+
+TEST_F(ControlTool, CheckConfigOfAGoodFile) {
+    root.write("/etc/relay-ok.conf", "{\"serverID\": \"ZR1\", \"log_level\": 4}\n");
+    std::string out;
+    EXPECT_EQ(0, Ctl({"check-config", root.path("/etc/relay-ok.conf")}, &out));
+    EXPECT_NE(std::string::npos, out.find("configuration OK"));
+    EXPECT_EQ(0, RunProgram({kDaemon, "--check-config", root.path("/etc/relay-ok.conf")}, &out));
+    EXPECT_EQ(5, Ctl({"check-config", root.path("/etc/missing.conf")}, &out));
 }

@@ -429,6 +429,16 @@ def main(argv=None):
     parser.add_argument("--verbose", action="store_true", help="log every request to standard error")
     args = parser.parse_args(argv)
 
+    # A stop request may come at any moment, even while the certificates are
+    # made: it ends the server quietly, never with a traceback.
+    stop = threading.Event()
+
+    def on_signal(signum, frame):
+        stop.set()
+
+    signal.signal(signal.SIGTERM, on_signal)
+    signal.signal(signal.SIGINT, on_signal)
+
     app = LocalServer()
     app.verbose = args.verbose
     load_routes(app, args.routes_dir)
@@ -454,14 +464,6 @@ def main(argv=None):
     for t in threads:
         t.start()
 
-    stop = threading.Event()
-
-    def on_signal(signum, frame):
-        stop.set()
-
-    signal.signal(signal.SIGTERM, on_signal)
-    signal.signal(signal.SIGINT, on_signal)
-
     write_ready(args.ready_file, {"http_port": app.http_port, "https_port": app.https_port,
                                   "ca_file": app.ca_file, "pid": os.getpid()})
     while not stop.wait(0.2):
@@ -477,4 +479,7 @@ def main(argv=None):
 
 
 if __name__ == "__main__":
-    sys.exit(main())
+    try:
+        sys.exit(main())
+    except KeyboardInterrupt:  # before main() could take over SIGINT
+        sys.exit(130)

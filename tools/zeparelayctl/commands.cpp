@@ -2,12 +2,20 @@
 
 #include <signal.h>
 #include <time.h>
+#include <unistd.h>
 
 #include <cstdio>
 #include <iostream>
 
+#include <json/writer.h>
+
 #include <zeparelayd/config.h>
+#include <zeparelayd/config_alias.h>
 #include <zeparelayd/daemon.h>
+#include <zeparelayd/errors.h>
+
+#include "config_check.h"
+#include "daemon_process.h"
 
 using namespace ZEPA::Relay;
 
@@ -22,26 +30,143 @@ void SleepMs(long ms) {
     nanosleep(&ts, nullptr);
 }
 
+// "not running", with the reason when a PID file names another process.
+void SayNotRunning(const PidFileState& daemon, FILE* out) {
+    fprintf(out, "%s\n", daemon.stale ? "not running (stale PID file)" : "not running");
+}
+
+// A signal for the daemon, only when the PID file names a live zeparelayd.
+int SignalDaemon(int sig, PidFileState& daemon) {
+    daemon = DaemonFromPidFile();
+    if (daemon.pid <= 0) return EXIT_NOT_RUNNING;
+    return kill(daemon.pid, sig) == 0 ? EXIT_OK : EXIT_NOT_RUNNING;
+}
+
+// The configuration as the daemon would read it; a broken one is named with
+// line and column, and nothing is sent.
+bool ConfigUsable(const std::string& path) {
+    const ConfigCheck check = CheckConfigFile(path);
+    for (const std::string& e : check.errors) fprintf(stderr, "zeparelayctl: %s\n", e.c_str());
+    if (!check.ok()) {
+        fprintf(stderr,
+                "zeparelayctl: configuration not valid; fix it and try again (check-config shows it)\n");
+    }
+    return check.ok();
+}
+
 // Asks a running daemon to re-read its configuration; says what happened.
 int Reload(const char* what) {
-    Daemon::LibInit();
-    if (Daemon::Signal(SIGHUP) == 0) {
+    PidFileState daemon;
+    if (SignalDaemon(SIGHUP, daemon) == EXIT_OK) {
         printf("%s; the daemon reloads its configuration\n", what);
         return EXIT_OK;
     }
-    printf("%s; the daemon does not run (it takes effect at the next start)\n", what);
+    printf("%s; the daemon is %s (it takes effect at the next start)\n", what,
+           daemon.stale ? "not running (stale PID file)" : "not running");
     return EXIT_NOT_RUNNING;
 }
 
-int Status(const Args& args) {
-    if (args.size() > 1 || (args.size() == 1 && args[0] != "--debug")) return EXIT_USAGE;
-    const bool debug = args.size() == 1;
-    const int ret = Daemon::Status(debug);
-    return ret;
+// A configuration that exists but is broken must not reach the library's
+// readers: they would set it aside as ".bad".
+bool ConfigReadable() { return access(ConfPath().c_str(), F_OK) != 0 || ConfigUsable(ConfPath()); }
+
+// What "status" shows, from the status file and, for the alias, the
+// configuration and the alias status file.
+struct StatusView {
+    int result = EXIT_OK;  // EXIT_OK, EXIT_NOT_RUNNING or EXIT_BROKEN_STATUS
+    std::string serverId, state, error, aliasName, aliasStatus;
+    Json::Value file;  // the status file while the daemon runs, else null
+};
+
+StatusView ReadStatus() {
+    StatusView view;
+    Json::Value file;
+    const int probe = Daemon::GetStatus(file);
+    if (!Daemon::GetStatus(view.serverId, view.state, view.error, nullptr)) {
+        view.result = EXIT_BROKEN_STATUS;
+        return view;
+    }
+    view.result = view.state == "not_running" ? EXIT_NOT_RUNNING : EXIT_OK;
+    if (view.result == EXIT_OK && probe == RELAYD_RESULT_OK) view.file = file;
+    // The alias the configuration names; when that file is broken, the one
+    // the daemon last reported.
+    const ConfigCheck check = CheckConfigFile(ConfPath());
+    if (check.ok()) {
+        RelaydConf conf(ConfPath().c_str());
+        view.aliasName = conf.alias.GetAliasName();
+    } else if (file.isObject() && file["alias"].isString()) {
+        view.aliasName = file["alias"].asString();
+    }
+    AliasStatus aliasStatus;
+    std::string extra;
+    aliasStatus.GetStatus(view.aliasName, view.aliasStatus, extra);
+    return view;
 }
 
-int StartLog(const Args& args) {
+int StatusText() {
+    const StatusView view = ReadStatus();
+    if (view.result == EXIT_BROKEN_STATUS) {
+        printf("get status failed\n");
+        fprintf(stderr, "zeparelayctl: the status file %s is broken\n", Daemon::GetStatusPath().c_str());
+        return view.result;
+    }
+    printf("serverID: %s\nstate: %s\nalias: %s\nalias_status: %s\n", view.serverId.c_str(),
+           view.state.c_str(), view.aliasName.c_str(), view.aliasStatus.c_str());
+    if (view.error != "success") printf("error: %s\n", view.error.c_str());
+    if (view.file["config_error"].isString())
+        printf("config_error: %s\n", view.file["config_error"].asCString());
+    return view.result;
+}
+
+// The status as one JSON object:
+//   {"state", "error", "serverID", "alias", "alias_status", "services", "pid"
+//    [, "tunnel"] [, "config_error"]}
+// "state" and "error" are the words of the status readers ("connected",
+// "err_auth", ...), null when the status file is broken; "services" lists the
+// relayed service ids; "pid" is the daemon's process id or null; "tunnel" and
+// "config_error" are copied from the status file when the daemon writes them.
+int StatusJson() {
+    const StatusView view = ReadStatus();
+    const bool broken = view.result == EXIT_BROKEN_STATUS;
+    Json::Value out(Json::objectValue);
+    out["state"] = broken ? Json::Value() : Json::Value(view.state);
+    out["error"] = broken ? Json::Value() : Json::Value(view.error);
+    out["serverID"] = view.serverId;
+    out["alias"] = view.aliasName;
+    out["alias_status"] = view.aliasStatus;
+    out["services"] = Json::Value(Json::arrayValue);
+    out["pid"] = Json::Value();
+    if (view.file.isObject()) {
+        for (const Json::Value& s : view.file["service"]) {
+            if (s.isObject() && s["id"].isString()) out["services"].append(s["id"]);
+        }
+        out["pid"] = view.file["pid"];
+        for (const char* key : {"tunnel", "config_error"}) {
+            if (view.file.isMember(key)) out[key] = view.file[key];
+        }
+    }
+    Json::StreamWriterBuilder writer;
+    writer["indentation"] = "";
+    printf("%s\n", Json::writeString(writer, out).c_str());
+    return view.result;
+}
+
+int Status(const Args& args, const Options& opt) {
+    if (!args.empty() || (opt.json && opt.debug)) return EXIT_USAGE;
+    if (opt.json) return StatusJson();
+    if (!opt.debug) return StatusText();
+    // The debug query signals the PID file's process: only ours.
+    const PidFileState daemon = DaemonFromPidFile();
+    if (daemon.pid <= 0) {
+        SayNotRunning(daemon, stderr);
+        return EXIT_NOT_RUNNING;
+    }
+    return Daemon::Status(true);
+}
+
+int StartLog(const Args& args, const Options&) {
     if (args.size() != 1) return EXIT_USAGE;
+    if (!ConfigReadable()) return EXIT_CONFIG;
     if (VLIBRelaydLogStart(args[0].c_str()) != 0) {
         fprintf(stderr, "zeparelayctl: cannot update the configuration %s\n", ConfPath().c_str());
         return EXIT_CONFIG;
@@ -50,8 +175,9 @@ int StartLog(const Args& args) {
     return EXIT_OK;
 }
 
-int StopLog(const Args& args) {
+int StopLog(const Args& args, const Options&) {
     if (!args.empty()) return EXIT_USAGE;
+    if (!ConfigReadable()) return EXIT_CONFIG;
     if (VLIBRelaydLogStop() != 0) {
         fprintf(stderr, "zeparelayctl: cannot update the configuration %s\n", ConfPath().c_str());
         return EXIT_CONFIG;
@@ -60,8 +186,9 @@ int StopLog(const Args& args) {
     return EXIT_OK;
 }
 
-int ServerId(const Args& args) {
+int ServerId(const Args& args, const Options&) {
     if (args.size() > 1) return EXIT_USAGE;
+    if (!ConfigReadable()) return EXIT_CONFIG;
     char buf[256];
     const int ret = VLIBRelaydGetServerId(args.empty() ? nullptr : args[0].c_str(), buf, sizeof(buf));
     if (ret < 0) {
@@ -82,39 +209,61 @@ int ServerId(const Args& args) {
     return EXIT_OK;
 }
 
-int UpdateAlias(const Args& args) {
-    if (!args.empty()) return EXIT_USAGE;
-    const int ret = Daemon::UpdateAlias();
-    if (ret == 0) printf("alias update requested\n");
-    if (ret == 1) fprintf(stderr, "zeparelayctl: the daemon does not run\n");
-    if (ret == 255) fprintf(stderr, "zeparelayctl: the status file is broken\n");
-    return ret == 0 ? EXIT_OK : ret == 1 ? EXIT_NOT_RUNNING : EXIT_BROKEN;
+// A signal that asks the running daemon for one thing; says it was sent.
+int Ask(int sig, const char* done) {
+    PidFileState daemon;
+    if (SignalDaemon(sig, daemon) != EXIT_OK) {
+        SayNotRunning(daemon, stderr);
+        return EXIT_NOT_RUNNING;
+    }
+    printf("%s\n", done);
+    return EXIT_OK;
 }
 
-int ReloadCmd(const Args& args) {
-    if (!args.empty()) return EXIT_USAGE;
-    return Reload("configuration unchanged");
+int UpdateAlias(const Args& args, const Options&) {
+    return args.empty() ? Ask(SIGRTMIN + 1, "alias update requested") : EXIT_USAGE;
 }
 
-// Waits (bounded) until the process recorded in the status file is gone.
-bool WaitGone(int seconds) {
+int ReloadCmd(const Args& args, const Options&) {
+    if (!args.empty()) return EXIT_USAGE;
+    const PidFileState daemon = DaemonFromPidFile();
+    if (daemon.pid <= 0) {
+        SayNotRunning(daemon, stderr);
+        return EXIT_NOT_RUNNING;
+    }
+    if (!ConfigUsable(ConfPath())) return EXIT_CONFIG;
+    return Reload("configuration checked");
+}
+
+int ReopenLog(const Args& args, const Options&) {
+    return args.empty() ? Ask(SIGRTMIN + 2, "the daemon reopens its log file") : EXIT_USAGE;
+}
+
+int CheckConfig(const Args& args, const Options&) {
+    if (args.size() > 1) return EXIT_USAGE;
+    return ReportConfigCheck("zeparelayctl", args.empty() ? ConfPath() : args[0]) ? EXIT_OK : EXIT_CONFIG;
+}
+
+// Waits (bounded) until the process is gone.
+bool WaitGone(pid_t pid, int seconds) {
     for (int i = 0; i < seconds * 20; ++i) {
-        Json::Value status;
-        if (Daemon::GetStatus(status) != 0) return true;
+        if (!IsProgram(pid, DaemonName())) return true;
         SleepMs(50);
     }
     return false;
 }
 
-int Stop(const Args& args) {
+int Stop(const Args& args, const Options&) {
     if (!args.empty()) return EXIT_USAGE;
-    Daemon::LibInit();
-    if (Daemon::Kill() != 0) {
-        fprintf(stderr, "zeparelayctl: the daemon does not run\n");
-        return EXIT_NOT_RUNNING;
+    PidFileState daemon;
+    if (SignalDaemon(SIGTERM, daemon) != EXIT_OK) {
+        // Stopping what does not run is done already.
+        SayNotRunning(daemon, stdout);
+        return EXIT_OK;
     }
-    if (!WaitGone(10)) {
-        fprintf(stderr, "zeparelayctl: the daemon did not stop within 10 s\n");
+    if (!WaitGone(daemon.pid, 10)) {
+        fprintf(stderr, "zeparelayctl: the daemon (pid %d) did not stop within 10 s\n",
+                static_cast<int>(daemon.pid));
         return EXIT_BROKEN;
     }
     printf("daemon stopped\n");
@@ -122,8 +271,14 @@ int Stop(const Args& args) {
 }
 
 int Switch(bool on) {
+    // Reading a broken file would make the library set it aside as ".bad"
+    // and this write replace it: the operator's configuration would be lost.
+    if (!ConfigReadable()) return EXIT_CONFIG;
     RelaydConf conf(ConfPath().c_str());
-    if (!conf.SetEnableConf(on)) return EXIT_CONFIG;
+    if (!conf.SetEnableConf(on)) {
+        fprintf(stderr, "zeparelayctl: cannot store \"runrelayd\" in the system settings\n");
+        return EXIT_CONFIG;
+    }
     conf.GenServiceConf();
     if (!conf.WriteConfigFile()) {
         fprintf(stderr, "zeparelayctl: cannot write the configuration %s\n", ConfPath().c_str());
@@ -134,24 +289,32 @@ int Switch(bool on) {
     return ret == EXIT_NOT_RUNNING ? EXIT_OK : ret;
 }
 
-int Enable(const Args& args) { return args.empty() ? Switch(true) : EXIT_USAGE; }
-int Disable(const Args& args) { return args.empty() ? Switch(false) : EXIT_USAGE; }
+int Enable(const Args& args, const Options&) { return args.empty() ? Switch(true) : EXIT_USAGE; }
+int Disable(const Args& args, const Options&) { return args.empty() ? Switch(false) : EXIT_USAGE; }
 
-int Services(const Args& args) {
+int Services(const Args& args, const Options&) {
     if (!args.empty()) return EXIT_USAGE;
+    if (!ConfigReadable()) return EXIT_CONFIG;
     RelaydConf conf(ConfPath().c_str());
     printf("%-24s %-24s %6s %8s\n", "ID", "NAME", "PORT", "EXT_PORT");
     for (const ServiceConf& s : conf.services) {
-        printf("%-24s %-24s %6d %8d\n", s.id.c_str(), s.name.c_str(), s.port, s.ext_port);
+        // -1 means absent: shown as "-".
+        const std::string port = s.port < 0 ? "-" : std::to_string(s.port);
+        const std::string ext = s.ext_port < 0 ? "-" : std::to_string(s.ext_port);
+        printf("%-24s %-24s %6s %8s\n", s.id.c_str(), s.name.c_str(), port.c_str(), ext.c_str());
     }
     return EXIT_OK;
 }
 
-int ConfigCmd(const Args& args) {
+int ConfigCmd(const Args& args, const Options&) {
     if (!args.empty()) return EXIT_USAGE;
+    if (!ConfigReadable()) return EXIT_CONFIG;
     RelaydConf conf(ConfPath().c_str());
     Json::Value full;
     conf.Write(full, true);
+    // The full form carries the writing process's id, here this tool's:
+    // not the daemon's, so it is left out.
+    full.removeMember("pid");
     // "-" makes the JSON writer print the styled text on standard output.
     return RelaydConf::WriteJsonFile("-", full) ? EXIT_OK : EXIT_CONFIG;
 }
@@ -159,10 +322,13 @@ int ConfigCmd(const Args& args) {
 }  // namespace
 
 const Command kCommands[] = {
-    {"status", "status [--debug]",
+    {"status", "status [--debug | --json]",
      "Prints the daemon's server id, state, alias and alias status (and the error\n"
      "when there is one). With --debug, asks the running daemon for its debug dump\n"
-     "and prints it as one JSON line.\n"
+     "and prints it as one JSON line. With --json, prints one JSON object:\n"
+     "  {\"state\": WORD|null, \"error\": WORD|null, \"serverID\": STRING,\n"
+     "   \"alias\": STRING, \"alias_status\": WORD, \"services\": [ID, ...],\n"
+     "   \"pid\": INT|null, \"tunnel\": OBJECT (only when the daemon reports one)}\n"
      "Exit status: 0 running, 1 not running, 2 broken status file; with --debug\n"
      "0, 1, 11 (busy or no dump) or 255 (broken files).\n",
      Status},
@@ -177,11 +343,26 @@ const Command kCommands[] = {
      "it only when that service is relayed, else \"--\" (exit status 6).\n",
      ServerId},
     {"update-alias", "update-alias", "Asks the running daemon to register the alias now.\n", UpdateAlias},
-    {"reload", "reload", "Asks the running daemon to re-read its configuration.\n", ReloadCmd},
-    {"stop", "stop", "Stops the running daemon and waits (at most 10 s) until it is gone.\n", Stop},
+    {"reload", "reload",
+     "Checks the configuration, then asks the running daemon to re-read it. A\n"
+     "broken file is named with line and column and not sent (exit status 5).\n",
+     ReloadCmd},
+    {"reopen-log", "reopen-log",
+     "Asks the running daemon to reopen its log file (after log rotation), without\n"
+     "reloading anything else (SIGRTMIN+2).\n",
+     ReopenLog},
+    {"check-config", "check-config [FILE]",
+     "Checks a relay configuration file (by default the daemon's) and prints what is\n"
+     "wrong as FILE:LINE:COLUMN: message. Exit status 0 usable, 5 broken.\n",
+     CheckConfig},
+    {"stop", "stop",
+     "Stops the running daemon and waits (at most 10 s) until it is gone. A daemon\n"
+     "that does not run counts as stopped (exit status 0).\n",
+     Stop},
     {"enable", "enable",
      "Switches the relay on (\"runrelayd\"), regenerates the service list, writes\n"
-     "the configuration and asks the daemon to reload.\n",
+     "the configuration and asks the daemon to reload. A broken configuration is\n"
+     "left as it is (exit status 5).\n",
      Enable},
     {"disable", "disable", "Switches the relay off, like enable otherwise.\n", Disable},
     {"services", "services", "Lists the relayed services of the configuration.\n", Services},

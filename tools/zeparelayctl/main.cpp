@@ -1,8 +1,11 @@
 // zeparelayctl: control of the relay daemon from the command line.
+#include <getopt.h>
+
 #include <cstdio>
 #include <cstring>
 #include <string>
 
+#include <zeparelayd/daemon.h>
 #include <zepasdk/sysroot.h>
 
 #include "commands.h"
@@ -10,27 +13,26 @@
 using zeparelayctl::Args;
 using zeparelayctl::Command;
 using zeparelayctl::kCommands;
+using namespace zepatools;
 
 namespace {
 
 void Usage(FILE* out) {
     fputs(
-        "Usage: zeparelayctl [--root DIR] COMMAND [ARGS]\n"
+        "Usage: zeparelayctl [OPTIONS] COMMAND [ARGS]   (options may come anywhere)\n"
         "Controls the relay daemon zeparelayd.\n"
         "\n"
         "  --root DIR     system root: every fixed path is taken below DIR\n"
+        "  -q, --quiet    print nothing on standard output; only the exit status tells\n"
+        "  -v, --verbose  also show the library's own log lines (on standard error)\n"
         "  -h, --help     this text; COMMAND --help explains one command\n"
         "  -V, --version  print the version\n"
         "\n"
         "Commands:\n",
         out);
     for (const Command* c = kCommands; c->name != nullptr; ++c) fprintf(out, "  %s\n", c->synopsis);
-    fputs(
-        "\n"
-        "Exit status: 0 done, 1 the daemon does not run, 2 broken status file,\n"
-        "5 configuration not readable or writable, 6 no server id / service not\n"
-        "relayed, 11 busy, 64 bad usage, 255 broken status or debug file.\n",
-        out);
+    fputs("\n", out);
+    fputs(kExitTable, out);
 }
 
 const Command* Find(const std::string& name) {
@@ -43,45 +45,78 @@ const Command* Find(const std::string& name) {
 }  // namespace
 
 int main(int argc, char** argv) {
-    int i = 1;
-    for (; i < argc && argv[i][0] == '-'; ++i) {
-        const std::string arg = argv[i];
-        if (arg == "-h" || arg == "--help") {
+    enum { OPT_ROOT = 256, OPT_JSON, OPT_DEBUG };
+    const option longOptions[] = {
+        {"root", required_argument, nullptr, OPT_ROOT}, {"quiet", no_argument, nullptr, 'q'},
+        {"verbose", no_argument, nullptr, 'v'},         {"help", no_argument, nullptr, 'h'},
+        {"version", no_argument, nullptr, 'V'},         {"json", no_argument, nullptr, OPT_JSON},
+        {"debug", no_argument, nullptr, OPT_DEBUG},     {nullptr, 0, nullptr, 0},
+    };
+    zeparelayctl::Options opt;
+    bool help = false;
+    bool quiet = false;
+    bool verbose = false;
+    int c;
+    while ((c = getopt_long(argc, argv, "qvhV", longOptions, nullptr)) != -1) {
+        switch (c) {
+            case OPT_ROOT:
+                if (ZEPASysRootSet(optarg) != 0) {
+                    fprintf(stderr, "zeparelayctl: --root %s: the root must be an absolute path\n", optarg);
+                    return EXIT_USAGE;
+                }
+                break;
+            case 'q':
+                quiet = true;
+                break;
+            case 'v':
+                verbose = true;
+                break;
+            case 'h':
+                help = true;
+                break;
+            case 'V':
+                printf("zeparelayctl %s\n", ZEPARELAYD_VERSION);
+                return EXIT_OK;
+            case OPT_JSON:
+                opt.json = true;
+                break;
+            case OPT_DEBUG:
+                opt.debug = true;
+                break;
+            default:  // getopt has named the option
+                fputs("Try 'zeparelayctl --help'.\n", stderr);
+                return EXIT_USAGE;
+        }
+    }
+    if (optind >= argc) {
+        if (help) {
             Usage(stdout);
-            return zeparelayctl::EXIT_OK;
+            return EXIT_OK;
         }
-        if (arg == "-V" || arg == "--version") {
-            printf("zeparelayctl %s\n", ZEPARELAYD_VERSION);
-            return zeparelayctl::EXIT_OK;
-        }
-        if (arg == "--root" && i + 1 < argc) {
-            if (ZEPASysRootSet(argv[++i]) != 0) {
-                fprintf(stderr, "zeparelayctl: the root must be an absolute path: %s\n", argv[i]);
-                return zeparelayctl::EXIT_USAGE;
-            }
-            continue;
-        }
-        fprintf(stderr, "zeparelayctl: unknown or incomplete option '%s'\n", arg.c_str());
         Usage(stderr);
-        return zeparelayctl::EXIT_USAGE;
+        return EXIT_USAGE;
     }
-    if (i >= argc) {
-        Usage(stderr);
-        return zeparelayctl::EXIT_USAGE;
-    }
-    const Command* cmd = Find(argv[i]);
+    const Command* cmd = Find(argv[optind]);
     if (cmd == nullptr) {
-        fprintf(stderr, "zeparelayctl: unknown command '%s'\n", argv[i]);
+        fprintf(stderr, "zeparelayctl: unknown command '%s'\n", argv[optind]);
         Usage(stderr);
-        return zeparelayctl::EXIT_USAGE;
+        return EXIT_USAGE;
     }
-    Args args(argv + i + 1, argv + argc);
-    if (args.size() == 1 && (args[0] == "--help" || args[0] == "-h")) {
+    if (help) {
         printf("Usage: zeparelayctl [--root DIR] %s\n\n%s", cmd->synopsis, cmd->help);
-        return zeparelayctl::EXIT_OK;
+        return EXIT_OK;
     }
-    const int ret = cmd->run(args);
-    if (ret == zeparelayctl::EXIT_USAGE) {
+    if ((opt.json || opt.debug) && strcmp(cmd->name, "status") != 0) {
+        fprintf(stderr, "zeparelayctl: --json and --debug belong to \"status\"\n");
+        return EXIT_USAGE;
+    }
+    // The library logs to standard error; in a tool that would mix its lines
+    // into the tool's own messages. Its readers report to the system log.
+    if (!verbose) ZEPA::Relay::Daemon::_logLevel = -1;
+    if (quiet && freopen("/dev/null", "w", stdout) == nullptr) return EXIT_BROKEN;
+    Args args(argv + optind + 1, argv + argc);
+    const int ret = cmd->run(args, opt);
+    if (ret == EXIT_USAGE) {
         fprintf(stderr, "zeparelayctl: usage: zeparelayctl %s\n", cmd->synopsis);
     }
     return ret;

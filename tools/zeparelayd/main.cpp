@@ -1,18 +1,18 @@
-// zeparelayd: the relay daemon.
-//
-// Exit statuses: 0 started (the parent reports the child's start-up word:
-// 0 started, 4 PID file not created, 255 no word) or stopped cleanly;
-// 1 a daemon already runs on the PID file; 2 bad usage; 3 the event loop
-// could not be set up.
+// zeparelayd: the relay daemon. Exit statuses: exit_codes.h (shared with
+// zeparelayctl); the parent of a forking start passes on the child's start-up
+// word (0 started, 4 PID file not created, 255 no word).
 #define RLOG_SOURCE "zeparelayd"
 
 #include <curl/curl.h>
+#include <getopt.h>
 #include <libdaemon/dpid.h>
 #include <libdaemon/dsignal.h>
 #include <limits.h>
 #include <signal.h>
 #include <stdlib.h>
+#include <unistd.h>
 
+#include <cerrno>
 #include <cstdio>
 #include <cstring>
 #include <string>
@@ -23,67 +23,118 @@
 #include <zepasdk/sysroot.h>
 
 #include "clock.h"
+#include "config_check.h"
+#include "daemon_process.h"
 #include "event_loop.h"
+#include "exit_codes.h"
 #include "log.h"
 #include "relay_daemon.h"
 
 using namespace ZEPA::Relay;
+using namespace zepatools;
 
 namespace {
 
 const char kUsage[] =
     "Usage: zeparelayd [OPTIONS]\n"
+    "       zeparelayd [--root DIR] --check-config [FILE]\n"
     "Relay daemon: registers the appliance's services with the relay's control\n"
     "server and keeps its alias registered.\n"
     "\n"
-    "  --root DIR       system root: every fixed path is taken below DIR\n"
-    "  --ca-file FILE   also trust this CA for https (staging set-ups only)\n"
-    "  -f, --foreground do not daemonise; log to standard error\n"
-    "  -h, --help       this text\n"
-    "  -V, --version    print the version\n"
+    "  --root DIR            system root: every fixed path is taken below DIR\n"
+    "  --ca-file FILE        also trust this CA for https (staging set-ups only)\n"
+    "  -f, --foreground      do not daemonise; log to standard error\n"
+    "  --check-config [FILE] check the configuration (by default the daemon's) and\n"
+    "                        print what is wrong as FILE:LINE:COLUMN: message\n"
+    "  -h, --help            this text\n"
+    "  -V, --version         print the version\n"
     "\n"
-    "Signals: TERM/INT/QUIT stop, HUP reloads the configuration, USR1 writes the\n"
-    "debug dump, RTMIN+1 updates the alias now.\n"
-    "Exit status: 0 started, 1 already running, 2 bad usage, 3 no event loop,\n"
-    "4 PID file not created, 255 the daemon gave no start-up word.\n";
+    "Signals: TERM/INT/QUIT stop, HUP reloads the configuration (a broken file is\n"
+    "refused and the last good configuration kept), USR1 writes the debug dump,\n"
+    "RTMIN+1 updates the alias now, RTMIN+2 reopens the log file.\n"
+    "\n";
 
 struct Options {
     std::string root;
     std::string caFile;
     bool foreground = false;
+    bool checkConfig = false;
+    std::string checkFile;
 };
 
-// 0 parsed, 1 done (help/version printed), 2 bad usage.
+// EXIT_OK parsed, -1 done (help/version printed), EXIT_USAGE bad usage.
 int ParseOptions(int argc, char** argv, Options& opt) {
-    for (int i = 1; i < argc; ++i) {
-        const std::string arg = argv[i];
-        if (arg == "-h" || arg == "--help") {
-            fputs(kUsage, stdout);
-            return 1;
-        }
-        if (arg == "-V" || arg == "--version") {
-            printf("zeparelayd %s\n", ZEPARELAYD_VERSION);
-            return 1;
-        }
-        if (arg == "-f" || arg == "--foreground") {
-            opt.foreground = true;
-        } else if ((arg == "--root" || arg == "--ca-file") && i + 1 < argc) {
-            (arg == "--root" ? opt.root : opt.caFile) = argv[++i];
-        } else {
-            fprintf(stderr, "zeparelayd: unknown or incomplete option '%s'\n%s", arg.c_str(), kUsage);
-            return 2;
+    enum { OPT_ROOT = 256, OPT_CA_FILE, OPT_CHECK };
+    const option longOptions[] = {
+        {"root", required_argument, nullptr, OPT_ROOT},
+        {"ca-file", required_argument, nullptr, OPT_CA_FILE},
+        {"foreground", no_argument, nullptr, 'f'},
+        {"check-config", no_argument, nullptr, OPT_CHECK},
+        {"help", no_argument, nullptr, 'h'},
+        {"version", no_argument, nullptr, 'V'},
+        {nullptr, 0, nullptr, 0},
+    };
+    int c;
+    while ((c = getopt_long(argc, argv, "fhV", longOptions, nullptr)) != -1) {
+        switch (c) {
+            case OPT_ROOT:
+                opt.root = optarg;
+                break;
+            case OPT_CA_FILE:
+                opt.caFile = optarg;
+                break;
+            case OPT_CHECK:
+                opt.checkConfig = true;
+                break;
+            case 'f':
+                opt.foreground = true;
+                break;
+            case 'h':
+                fputs(kUsage, stdout);
+                fputs(kExitTable, stdout);
+                return -1;
+            case 'V':
+                printf("zeparelayd %s\n", ZEPARELAYD_VERSION);
+                return -1;
+            default:  // getopt has named the option
+                fputs("Try 'zeparelayd --help'.\n", stderr);
+                return EXIT_USAGE;
         }
     }
-    return 0;
+    // --check-config takes one optional FILE; nothing else takes arguments.
+    if (opt.checkConfig && optind < argc) opt.checkFile = argv[optind++];
+    if (optind < argc) {
+        fprintf(stderr, "zeparelayd: unexpected argument '%s'\nTry 'zeparelayd --help'.\n", argv[optind]);
+        return EXIT_USAGE;
+    }
+    return EXIT_OK;
 }
 
-// libdaemon changes to "/" when it forks: relative names must be made absolute first.
-bool Absolute(std::string& path) {
+// libdaemon changes to "/" when it forks: relative names must be made
+// absolute first. A name that does not resolve is reported with its cause.
+bool Absolute(const char* option, std::string& path) {
     if (path.empty()) return true;
     char buf[PATH_MAX];
-    if (realpath(path.c_str(), buf) == nullptr) return false;
+    if (realpath(path.c_str(), buf) == nullptr) {
+        fprintf(stderr, "zeparelayd: %s %s: %s\n", option, path.c_str(), strerror(errno));
+        return false;
+    }
     path = buf;
     return true;
+}
+
+// A PID file naming a process that is not a zeparelayd (left by a crash, its
+// number since reused) would make the start fail: it is removed instead.
+void RemoveStalePidFile() {
+    const PidFileState daemon = DaemonFromPidFile();
+    if (!daemon.stale) return;
+    const char* pidFile = Daemon::GetPidFile();
+    if (unlink(pidFile) == 0) {
+        fprintf(stderr, "zeparelayd: removed the stale PID file %s (it named no running zeparelayd)\n",
+                pidFile);
+    } else if (errno != ENOENT) {
+        fprintf(stderr, "zeparelayd: cannot remove the stale PID file %s: %s\n", pidFile, strerror(errno));
+    }
 }
 
 }  // namespace
@@ -91,19 +142,33 @@ bool Absolute(std::string& path) {
 int main(int argc, char** argv) {
     Options opt;
     const int parsed = ParseOptions(argc, argv, opt);
-    if (parsed != 0) return parsed == 1 ? 0 : 2;
-    if (!Absolute(opt.root) || !Absolute(opt.caFile)) {
-        fprintf(stderr, "zeparelayd: no such directory or file: %s\n", strerror(errno));
-        return 2;
-    }
+    if (parsed != EXIT_OK) return parsed < 0 ? EXIT_OK : parsed;
+    if (!Absolute("--root", opt.root) || !Absolute("--ca-file", opt.caFile)) return EXIT_USAGE;
     if (!opt.root.empty() && ZEPASysRootSet(opt.root.c_str()) != 0) {
-        fprintf(stderr, "zeparelayd: bad root '%s'\n", opt.root.c_str());
-        return 2;
+        fprintf(stderr, "zeparelayd: --root %s: not usable as the system root\n", opt.root.c_str());
+        return EXIT_USAGE;
     }
     if (!opt.caFile.empty()) Request::SetExtraCaFile(opt.caFile);
 
     Daemon::SetName(argv[0]);
     const std::string confPath = Daemon::GetConfPath();
+    if (opt.checkConfig) {
+        Daemon::_logLevel = -1;  // the check speaks for itself, on standard error
+        return ReportConfigCheck("zeparelayd", opt.checkFile.empty() ? confPath : opt.checkFile)
+                   ? EXIT_OK
+                   : EXIT_CONFIG;
+    }
+    // A broken file would be set aside as ".bad" by the library and the
+    // daemon would run on defaults: the operator fixes it first.
+    if (access(confPath.c_str(), F_OK) == 0) {
+        const ConfigCheck check = CheckConfigFile(confPath);
+        if (!check.ok()) {
+            for (const std::string& e : check.errors) fprintf(stderr, "zeparelayd: %s\n", e.c_str());
+            fprintf(stderr, "zeparelayd: not started: fix the configuration (zeparelayd --check-config)\n");
+            return EXIT_CONFIG;
+        }
+    }
+    RemoveStalePidFile();
     {
         // Log settings before forking, so that the child's standard error
         // points at the configured file from its first line on.
@@ -117,16 +182,24 @@ int main(int argc, char** argv) {
     sigset_t held;
     sigemptyset(&held);
     for (int sig : {SIGINT, SIGTERM, SIGQUIT, SIGPIPE, SIGHUP, SIGCHLD, SIGALRM, SIGUSR1, SIGUSR2,
-                    SIGRTMIN + 1, SIGRTMIN + 5}) {
+                    SIGRTMIN + 1, SIGRTMIN + 5, zeparelayd::ReopenLogSignal()}) {
         sigaddset(&held, sig);
     }
     sigset_t previous;
     sigprocmask(SIG_BLOCK, &held, &previous);
-    if (Daemon::InitSignalHandler() < 0) {
+    if (Daemon::InitSignalHandler() < 0 || daemon_signal_install(zeparelayd::ReopenLogSignal()) < 0) {
         fprintf(stderr, "zeparelayd: cannot install the signal handlers\n");
-        return 3;
+        return EXIT_NO_LOOP;
     }
-    if (!Daemon::Init(!opt.foreground)) return 1;
+    if (!Daemon::Init(!opt.foreground)) {
+        if (DaemonFromPidFile().pid > 0) {
+            fprintf(stderr, "zeparelayd: not started: a zeparelayd already runs on the PID file %s\n",
+                    Daemon::GetPidFile());
+            return EXIT_ALREADY_RUNNING;
+        }
+        fprintf(stderr, "zeparelayd: not started: cannot create the PID file %s\n", Daemon::GetPidFile());
+        return EXIT_NO_PID_FILE;
+    }
 
     curl_global_init(CURL_GLOBAL_DEFAULT);
     int status = 0;
@@ -137,13 +210,13 @@ int main(int argc, char** argv) {
         relay.ApplyLogSettings();
         if (!loop.IsReady()) {
             RLOG(LOG_ERR, "cannot set up the event loop");
-            status = 3;
+            status = EXIT_NO_LOOP;
         } else {
             loop.OnSignal([&relay](int sig) { relay.HandleSignal(sig); });
             loop.OnIdle([&relay] { relay.Idle(); });
             const bool started = relay.Start();
             sigprocmask(SIG_SETMASK, &previous, nullptr);
-            if (!started || !loop.Run()) status = 3;
+            if (!started || !loop.Run()) status = EXIT_NO_LOOP;
             relay.Shutdown();
         }
     }

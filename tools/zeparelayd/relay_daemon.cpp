@@ -8,6 +8,7 @@
 
 #include <zeparelayd/daemon.h>
 
+#include "config_check.h"
 #include "debug_dump.h"
 #include "log.h"
 #include "systemd_notify.h"
@@ -29,6 +30,8 @@ RelayDaemon::RelayDaemon(const std::string& confPath, EventLoop& loop, const Clo
           *_conf, loop, clock,
           AliasCycle::Hooks{[this] { return _state == RELAYD_STATE_CONNECTED; }, [this] { WriteStatus(); }}) {
 }
+
+int ReopenLogSignal() { return SIGRTMIN + 2; }
 
 void ApplyLogSettings(const RelaydConf& conf) {
     const std::string file = Daemon::ResolvePath(conf.logFile);
@@ -57,6 +60,13 @@ void RelayDaemon::HandleSignal(int sig) {
         _alias.OnRequested();
         return;
     }
+    if (sig == ReopenLogSignal()) {
+        // Same file and level as now: SetLogFile reopens it (appending).
+        RLOG(LOG_INFO, "reopening the log file");
+        Daemon::SetLogFile(Daemon::_strLogFile, Daemon::_logLevel);
+        RLOG(LOG_INFO, "log file reopened");
+        return;
+    }
     switch (sig) {
         case SIGTERM:
         case SIGINT:
@@ -82,10 +92,23 @@ void RelayDaemon::HandleSignal(int sig) {
 
 void RelayDaemon::Reload() {
     RLOG(LOG_NOTICE, "reloading configuration");
-    if (!_conf->Reload()) {
-        // The old configuration stays in force; the library said why.
+    // The library would set a broken file aside as ".bad" and go on with a
+    // configuration that has lost the operator's settings: a broken file is
+    // refused here, and the last good configuration stays in force.
+    const zepatools::ConfigCheck check = zepatools::CheckConfigFile(Daemon::GetConfPath());
+    if (!check.ok()) {
+        for (const std::string& e : check.errors) RLOG(LOG_ERR, "reload refused: %s", e.c_str());
+        _configError = check.first();
+        SetState(_state, RELAYD_ERR_CONFIG);
         return;
     }
+    if (!_conf->Reload()) {
+        // The old configuration stays in force; the library said why.
+        _configError = Daemon::GetConfPath() + ": not a valid relay configuration";
+        SetState(_state, RELAYD_ERR_CONFIG);
+        return;
+    }
+    _configError.clear();
     ApplyLogSettings();
     _alias.Reset();
     _registration.Restart();

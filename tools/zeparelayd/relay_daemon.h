@@ -25,6 +25,10 @@
 
 namespace zeparelayd {
 
+// The signal that makes the daemon reopen its log file (after rotation) and
+// nothing else: SIGRTMIN+2 (SIGUSR2 belongs to the tunnel).
+int ReopenLogSignal();
+
 // "log_level" and "log_file" of a configuration through Daemon::SetLogFile;
 // the file is an appliance path, taken below the system root.
 void ApplyLogSettings(const ZEPA::Relay::RelaydConf& conf);
@@ -72,6 +76,9 @@ private:
     ZEPA::Relay::RELAYD_STATE _state;
     ZEPA::Relay::RELAYD_RET _error;
     Json::Value _lastStatus;
+    // Why the last reload was refused ("FILE:LINE:COLUMN: ..."); empty after a
+    // good one. Shown in the status file as "config_error".
+    std::string _configError;
     RegistrationCycle _registration;
     AliasCycle _alias;
 };

@@ -41,6 +41,7 @@ void RelayDaemon::WriteStatus() {
     _conf->WriteServices(status["service"], true);
     status["alias"] = _conf->alias.GetAliasName();
     status["alias_status"] = _alias.Word();
+    if (!_configError.empty()) status["config_error"] = _configError;
     if (status == _lastStatus) return;
     if (RelaydConf::WriteJsonFile(Daemon::GetStatusPath(), status)) _lastStatus = status;
     NotifyStatus(ServiceStatusLine(GetStateStr(_state), GetErrorStr(_error), _alias.Word()));
