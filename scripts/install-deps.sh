@@ -8,6 +8,7 @@ PACKAGES=(
   libjsoncpp-dev libcurl4-openssl-dev libssl-dev libdaemon-dev libboost-dev
   libgtest-dev libgmock-dev libbenchmark-dev
   python3 openssl ca-certificates procps iproute2 clang-format clang-tidy
+  openvpn
 )
 
 missing=()
