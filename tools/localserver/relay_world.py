@@ -125,25 +125,34 @@ class RelayWorld:
         for sub in ("users", "tunnels", "tmp", "pki"):
             os.makedirs(os.path.join(self.work, sub), mode=0o700, exist_ok=True)
         self._namespaces()
+        # The web service's interpreter starts while the certificates are made.
+        self._start_web()
         self._pki()
         self._scripts()
         for proto in ("udp", "tcp"):
             self.start_server(proto)
-        self._start_web()
+        self._wait_web()
 
     def _namespaces(self):
         for ns in (self.relay_ns, self.appliance_ns):
             if os.path.exists("/run/netns/" + ns):
                 raise RelayWorldError("network namespace %s exists already" % ns)
-            _run("ip", "netns", "add", ns)
-            self.created.append(ns)
-        # Both ends are created inside their namespaces: nothing appears in ours.
-        _run("ip", "link", "add", "relay0", "netns", self.relay_ns, "type", "veth", "peer", "name", "wan0",
-             "netns", self.appliance_ns)
+        self.created = [self.relay_ns, self.appliance_ns]
+        # One ip process per namespace. Both veth ends are created inside
+        # their namespaces: nothing appears in ours.
+        self._ip_batch(None, ["netns add " + self.relay_ns, "netns add " + self.appliance_ns,
+                              "link add relay0 netns %s type veth peer name wan0 netns %s"
+                              % (self.relay_ns, self.appliance_ns)])
         for ns, dev, addr in ((self.relay_ns, "relay0", RELAY_IP), (self.appliance_ns, "wan0", APPLIANCE_WAN_IP)):
-            _run("ip", "-n", ns, "addr", "add", addr + "/30", "dev", dev)
-            _run("ip", "-n", ns, "link", "set", dev, "up")
-            _run("ip", "-n", ns, "link", "set", "lo", "up")
+            self._ip_batch(ns, ["addr add %s/30 dev %s" % (addr, dev), "link set %s up" % dev, "link set lo up"])
+
+    @staticmethod
+    def _ip_batch(ns, lines):
+        cmd = ["ip"] + (["-n", ns] if ns else []) + ["-batch", "-"]
+        done = subprocess.run(cmd, input="\n".join(lines) + "\n", stdout=subprocess.PIPE, stderr=subprocess.PIPE,
+                              text=True)
+        if done.returncode != 0:
+            raise RelayWorldError("setting up the namespaces failed: " + done.stderr.strip())
 
     def _pki(self):
         pki = os.path.join(self.work, "pki")
@@ -194,7 +203,7 @@ class RelayWorld:
             log = os.path.join(self.work, "openvpn-%s.log" % proto)
             if os.path.exists(log):
                 os.unlink(log)
-            cmd = ["ip", "netns", "exec", self.relay_ns, "/usr/sbin/openvpn",
+            cmd = ["nsenter", "--net=/run/netns/" + self.relay_ns, "/usr/sbin/openvpn",
                    "--server", POOLS[proto], "255.255.255.0", "--topology", "p2p",
                    "--proto", "udp" if proto == "udp" else "tcp-server",
                    "--local", RELAY_IP, "--port", str(VPN_PORT), "--dev", "tun", "--tun-mtu", "1400",
@@ -208,7 +217,9 @@ class RelayWorld:
                    "--comp-lzo", "adaptive", "--allow-compression", "asym",
                    "--keepalive", "3", "30", "--verb", "3", "--log", log]
             if proto == "udp":
-                cmd += ["--explicit-exit-notify", "1"]
+                # Both ways: a stopped server tells its clients, a stopped
+                # client tells the server (its proxy entry goes at once).
+                cmd += ["--explicit-exit-notify", "1", "--push", "explicit-exit-notify 1"]
             self.servers[proto] = subprocess.Popen(cmd, stdin=subprocess.DEVNULL, stdout=subprocess.DEVNULL,
                                                    stderr=subprocess.DEVNULL)
         self._wait_for_log(log, "Initialization Sequence Completed", self.servers[proto], proto)
@@ -237,9 +248,13 @@ class RelayWorld:
     def _start_web(self):
         web = os.path.join(os.path.dirname(os.path.abspath(__file__)), "appliance_web.py")
         ready = os.path.join(self.work, "web.ready")
-        self.web = subprocess.Popen(["ip", "netns", "exec", self.appliance_ns, sys.executable, web,
+        self.web_ready = ready
+        self.web = subprocess.Popen(["nsenter", "--net=/run/netns/" + self.appliance_ns, sys.executable, web,
                                      "--port", str(WEB_PORT), "--ready-file", ready],
                                     stdin=subprocess.DEVNULL)
+
+    def _wait_web(self):
+        ready = self.web_ready
         deadline = time.monotonic() + 10
         while not os.path.exists(ready):
             if self.web.poll() is not None or time.monotonic() > deadline:
@@ -251,8 +266,9 @@ class RelayWorld:
         if self.web is not None:
             _stop(self.web)
             self.web = None
-        for ns in reversed(self.created):
-            subprocess.run(["ip", "netns", "del", ns], stdout=subprocess.DEVNULL, stderr=subprocess.DEVNULL)
+        if self.created:
+            subprocess.run(["ip", "-force", "-batch", "-"], input="".join("netns del %s\n" % ns for ns in self.created),
+                           stdout=subprocess.DEVNULL, stderr=subprocess.DEVNULL, text=True)
         self.created = []
         shutil.rmtree(os.path.join(self.work, "pki"), ignore_errors=True)
 

@@ -175,7 +175,10 @@ def _proxy(server, book, core, req):
     import relay_world
     try:
         with relay_world.InNamespace(relay.relay_ns):
-            sock = socket.create_connection((address, relay.info()["web_port"]), timeout=10)
+            # A tunnel entry outlives its client by a few seconds (the
+            # server's delayed exit): do not wait long for a dead one.
+            sock = socket.create_connection((address, relay.info()["web_port"]), timeout=3)
+        sock.settimeout(10)
     except OSError as exc:
         return core.text_reply("tunnel unreachable: %s\n" % exc, 504)
     conn = http.client.HTTPConnection(address, relay.info()["web_port"], timeout=10)
