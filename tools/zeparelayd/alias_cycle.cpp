@@ -69,7 +69,7 @@ void RelayDaemon::StopAliasCycle() {
 
 void RelayDaemon::RunAlias(ALIAS_REQUEST_CMD cmd) {
     _aliasNextCmd.clear();
-    if (_state != RELAYD_STATE_CONNECTED) {
+    if (!IsRegistered()) {
         ZLOG(ZEPA_LOG_INFO, "alias %s skipped: not registered", CommandWord(cmd));
         return;
     }

@@ -63,12 +63,17 @@ void RelayDaemon::StartRegistration() {
     if (!_conf->enable) {
         ZLOG(ZEPA_LOG_NOTICE, "relay is disabled, idle until reload");
         StopAliasCycle();
+        _loop.CancelTimer("heartbeat");
+        TeardownTunnel(true);
+        _tunnel.reset();
+        _connectMode.clear();
         SetState(RELAYD_STATE_LOGOUT, RELAYD_SUCCESS);
         return;
     }
     const std::string url = _conf->serverControl.GetUrl(nullptr);
     boost::shared_ptr<Request> req(new Request(url, RegistrationBody(), true));
-    SetState(RELAYD_STATE_LOGIN, _error);
+    // A heartbeat keeps the state it has: the connection stays as it is.
+    if (!IsRegistered()) SetState(RELAYD_STATE_LOGIN, _error);
     if (url.empty() || !_loop.StartRequest("register", req,
                                            [this](boost::shared_ptr<Request> r) { OnRegistrationDone(r); })) {
         ZLOG(ZEPA_LOG_ERR, "cannot send registration to [%s]", url.c_str());
@@ -109,9 +114,13 @@ void RelayDaemon::OnRegistrationDone(boost::shared_ptr<Request> req) {
     }
     _regFailures = 0;
     if (answer["serverID"].isString()) StoreServerId(answer["serverID"].asString());
-    SetState(RELAYD_STATE_CONNECTED, RELAYD_SUCCESS);
     ZLOG(ZEPA_LOG_NOTICE, "registered, server id [%s]", _conf->serverID.c_str());
-    if (!_aliasHalted) ScheduleAlias(_aliasMapped ? ALIAS_REQ_KEEP_ALIVE : ALIAS_REQ_MAP, 0, "registered");
+    OnRegistered(answer);
+    // A heartbeat leaves a scheduled or running alias exchange alone.
+    const bool aliasPending = _loop.TimerRemaining("alias") >= 0 || _loop.HasRequest("alias");
+    if (!_aliasHalted && !aliasPending) {
+        ScheduleAlias(_aliasMapped ? ALIAS_REQ_KEEP_ALIVE : ALIAS_REQ_MAP, 0, "registered");
+    }
 }
 
 bool RelayDaemon::StoreServerId(const std::string& id) {

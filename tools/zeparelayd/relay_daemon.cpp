@@ -27,7 +27,9 @@ RelayDaemon::RelayDaemon(const std::string& confPath, EventLoop& loop)
       _aliasFailures(0),
       _aliasHalted(false),
       _aliasMapped(false),
-      _aliasRetryClass(-1) {}
+      _aliasRetryClass(-1),
+      _tunnelFailures(0),
+      _heartbeatSeconds(0) {}
 
 void ApplyLogSettings(const RelaydConf& conf) {
     const std::string file = conf.logFile.empty() ? std::string() : Paths::Resolve(conf.logFile);
@@ -70,6 +72,7 @@ void RelayDaemon::HandleSignal(int sig) {
             break;
         case SIGCHLD:
             ReapChildren();
+            CheckTunnel();
             break;
         default:
             // SIGUSR1 never comes this way (debug_dump.h).
@@ -89,7 +92,14 @@ void RelayDaemon::Reload() {
     ApplyLogSettings();
     _loop.CancelRequests("register");
     _loop.CancelTimer("register");
+    _loop.CancelTimer("heartbeat");
     StopAliasCycle();
+    // Switched off: the alias stops pointing at an appliance nobody relays.
+    if (!_conf->enable) DeleteAliasOnDisable();
+    // A new configuration may name other servers: the tunnel starts afresh.
+    TeardownTunnel(true);
+    _tunnel.reset();
+    _tunnelFailures = 0;
     _regFailures = 0;
     _regHalted = false;
     _aliasFailures = 0;
@@ -109,6 +119,7 @@ void RelayDaemon::ReapChildren() {
 void RelayDaemon::Shutdown() {
     _loop.CancelRequests("register");
     StopAliasCycle();
+    TeardownTunnel(true);
     RemoveDebugDump();
     SetState(RELAYD_STATE_STOPED, _error);
     ZLOG(ZEPA_LOG_NOTICE, "stopped");

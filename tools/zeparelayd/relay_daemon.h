@@ -15,6 +15,7 @@
 #include <zeparelayd/errors.h>
 #include <zeparelayd/request.h>
 #include <zeparelayd/request_alias.h>
+#include <zeparelayd/tunnel.h>
 
 #include "event_loop.h"
 
@@ -28,13 +29,15 @@ void ApplyLogSettings(const ZEPA::Relay::RelaydConf& conf);
 //   2 "starting"   configuration loaded, nothing sent yet
 //   3 "login"      registering with the control server, or waiting to retry
 //                  ("error" tells why the last attempt failed)
+//   4 "direct_connect"  registered; the control server reaches the appliance
+//                  directly, no tunnel
 //   5 "connected"  registered: the control server knows the services and
-//                  gave the server id
+//                  gave the server id (no connection word in its answer, or
+//                  a tunnel being opened)
+//   6 "connected"  registered and the VPN tunnel to the relay is up
 //   7 "logout"     the relay is switched off ("runrelayd" is not "yes"); the
 //                  daemon idles until the next reload
 //   8 "stoped"     the daemon has stopped (written last, on the way out)
-// 4 "direct_connect" and 6 (the tunnel's "connected") are not used by this
-// daemon: it never opens a tunnel.
 class RelayDaemon {
 public:
     RelayDaemon(const std::string& confPath, EventLoop& loop);
@@ -66,6 +69,19 @@ private:
     void RecordAliasStatus(const std::string& word, const std::string& extra);
     void StopAliasCycle();
 
+    // ---- connection and tunnel (tunnel_cycle.cpp) ----------------------------
+    bool IsRegistered() const;
+    void OnRegistered(const Json::Value& answer);
+    void ScheduleHeartbeat();
+    void OpenTunnel();
+    void TunnelFailed(ZEPA::Relay::RELAYD_RET error);
+    // After SIGCHLD: READY -> CLOSE once the reaped child is gone.
+    void CheckTunnel();
+    // Destroy; with waitForChild the VPN child is also waited for (stop).
+    void TeardownTunnel(bool waitForChild);
+    Json::Value TunnelStatus() const;
+    void DeleteAliasOnDisable();
+
     // ---- published files (status_writer.cpp) ---------------------------------
     void SetState(ZEPA::Relay::RELAYD_STATE state, ZEPA::Relay::RELAYD_RET error);
     void WriteStatus();
@@ -95,6 +111,13 @@ private:
     std::string _aliasExtra;
     int _aliasRetryClass;
     std::string _aliasNextCmd;
+
+    // Connection bookkeeping.
+    std::string _connectMode;  // "direct", "tunnel" or empty, from the last answer
+    std::unique_ptr<ZEPA::Relay::Tunnel> _tunnel;
+    std::string _tunnelPeer;
+    int _tunnelFailures;
+    int _heartbeatSeconds;
 };
 
 }  // namespace zeparelayd

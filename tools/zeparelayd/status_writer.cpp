@@ -81,6 +81,9 @@ void RelayDaemon::WriteStatus() {
     }
     status["alias"] = _conf->alias.GetAliasName();
     status["alias_status"] = _aliasWord;
+    const Json::Value connection = TunnelStatus();
+    status["connect"] = connection["connect"];
+    if (connection.isMember("tunnel")) status["tunnel"] = connection["tunnel"];
     if (status == _lastStatus) return;
     if (RelaydConf::WriteJsonFile(Paths::Resolve(Paths::STATUS_FILE), status)) _lastStatus = status;
 }
@@ -111,6 +114,11 @@ Json::Value RelayDaemon::DebugDump() const {
     alias["mapped"] = _aliasMapped;
     alias["next"] = _aliasNextCmd;
     alias["next_in_ms"] = static_cast<Json::Int64>(_loop.TimerRemaining("alias"));
+
+    Json::Value& connection = dump["connection"];
+    connection = TunnelStatus();
+    connection["heartbeat_s"] = _heartbeatSeconds;
+    connection["heartbeat_in_ms"] = static_cast<Json::Int64>(_loop.TimerRemaining("heartbeat"));
 
     Json::Value& requests = dump["requests"];
     requests = Json::Value(Json::arrayValue);
