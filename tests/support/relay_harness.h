@@ -11,6 +11,7 @@
 
 #include <memory>
 #include <string>
+#include <vector>
 
 #include "support/local_server.h"
 #include "support/test_support.h"
@@ -68,6 +69,12 @@ private:
     std::unique_ptr<LocalServer> _server;
     std::string _error;
 };
+
+// Runs a program, waits for it and gives its exit status (-1 when it did not
+// exit normally); its standard output goes to out when given.
+int RunProgram(const std::vector<std::string>& args, std::string* out = nullptr);
+// Names in a folder, one per line.
+std::string ListDir(const std::string& dir);
 
 // Handlers for the signals a tunnel start relies on (SIGCHLD, SIGUSR2,
 // SIGALRM), as the daemon has them.

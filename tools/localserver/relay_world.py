@@ -179,8 +179,9 @@ class RelayWorld:
             "verify.sh": "#!/bin/sh\n"
                          "user=$(sed -n 1p \"$1\"); pass=$(sed -n 2p \"$1\")\n"
                          "set -- \"$user\"\n" + name_check +
+                         "[ -f '%s/refuse_all' ] && exit 1\n"
                          "[ -f '%s'/\"$user\" ] || exit 1\n"
-                         "[ \"$(cat '%s'/\"$user\")\" = \"$pass\" ]\n" % (users, users),
+                         "[ \"$(cat '%s'/\"$user\")\" = \"$pass\" ]\n" % (self.work, users, users),
             "connect.sh": "#!/bin/sh\nset -- \"$common_name\"\n" + name_check +
                           "printf '%%s' \"$ifconfig_pool_remote_ip\" >'%s'/\"$1\".tmp && "
                           "mv -f '%s'/\"$1\".tmp '%s'/\"$1\"\n" % (tunnels, tunnels, tunnels),
@@ -299,6 +300,15 @@ class RelayWorld:
             if not user.endswith(".tmp"):
                 out[user] = self.tunnel_address(user)
         return out
+
+    def refuse_all(self, on):
+        """Every password is refused while on (a relay that no longer knows
+        the credentials it handed out)."""
+        path = os.path.join(self.work, "refuse_all")
+        if on:
+            open(path, "w").close()
+        elif os.path.exists(path):
+            os.unlink(path)
 
     def block_udp(self, on):
         """Drops the appliance's UDP to the relay's VPN port, as a strict

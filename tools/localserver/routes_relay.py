@@ -46,6 +46,7 @@ Admin calls for tests and demos:
   POST /relay/admin/heartbeat {"seconds": N}       (0: none)
   POST /relay/admin/grant {"user", "alias"?}       -> {"relay_ip", "relay_user", "relay_pass"}
   POST /relay/admin/block_udp {"on": bool}         UDP to the VPN port dropped
+  POST /relay/admin/refuse {"on": bool}            the VPN servers refuse every password
   POST /relay/admin/vpn {"action": "stop" | "start"}   the VPN servers
   GET  /relay/admin/tunnels                        -> {"tunnels": {user: address}, "aliases": {...}}
 
@@ -262,6 +263,12 @@ def register(server):
         server.relay.block_udp(bool(req.json().get("on")))
         return core.json_reply({"ok": True})
 
+    def refuse(req):
+        if server.relay is None:
+            return needs_relay()
+        server.relay.refuse_all(bool(req.json().get("on")))
+        return core.json_reply({"ok": True})
+
     def vpn(req):
         if server.relay is None:
             return needs_relay()
@@ -288,6 +295,7 @@ def register(server):
     server.route("/relay/admin/grant", grant, methods=["POST"])
     server.route("/relay/admin/block_udp", block_udp, methods=["POST"])
     server.route("/relay/admin/vpn", vpn, methods=["POST"])
+    server.route("/relay/admin/refuse", refuse, methods=["POST"])
     server.route("/relay/admin/tunnels", tunnels, methods=["GET"])
     server.route(PAGE, serv, methods=["POST"])
     server.route("/relay/admin/reassign", reassign, methods=["POST"])

@@ -69,12 +69,14 @@ void RelayDaemon::OnRegistered(const Json::Value& answer) {
         }
     } else {
         if (!_connectMode.empty() && _connectMode != "direct") {
-            ZLOG(ZEPA_LOG_WARNING, "unknown connect mode [%s], taken as registered only", _connectMode.c_str());
+            ZLOG(ZEPA_LOG_WARNING, "unknown connect mode [%s], taken as registered only",
+                 _connectMode.c_str());
         }
         TeardownTunnel(false);
         _tunnel.reset();
         _tunnelFailures = 0;
-        SetState(_connectMode == "direct" ? RELAYD_STATE_DIRECT_CONNECT : RELAYD_STATE_CONNECTED, RELAYD_SUCCESS);
+        SetState(_connectMode == "direct" ? RELAYD_STATE_DIRECT_CONNECT : RELAYD_STATE_CONNECTED,
+                 RELAYD_SUCCESS);
     }
     ScheduleHeartbeat();
 }
@@ -95,7 +97,8 @@ void RelayDaemon::OpenTunnel() {
         TunnelFailed(RELAYD_ERR_NOT_SUPPORT);
         return;
     }
-    ZLOG(ZEPA_LOG_INFO, "opening a tunnel to [%s] as [%s]", _tunnel->relay_ip.c_str(), _tunnel->relay_user.c_str());
+    ZLOG(ZEPA_LOG_INFO, "opening a tunnel to [%s] as [%s]", _tunnel->relay_ip.c_str(),
+         _tunnel->relay_user.c_str());
     // Blocks until the up script signals, the child dies or 40 s pass, per
     // protocol; the handlers it needs are libdaemon's.
     const int64_t started = NowMs();
@@ -107,8 +110,8 @@ void RelayDaemon::OpenTunnel() {
     }
     _tunnelFailures = 0;
     _tunnelPeer = Tunnel::GetVpnTunnelPeerIp();
-    ZLOG(ZEPA_LOG_NOTICE, "tunnel up in %lld ms, pid %d, peer [%s]", static_cast<long long>(NowMs() - started),
-         _tunnel->pid, _tunnelPeer.c_str());
+    ZLOG(ZEPA_LOG_NOTICE, "tunnel up in %lld ms, pid %d, peer [%s]",
+         static_cast<long long>(NowMs() - started), _tunnel->pid, _tunnelPeer.c_str());
     SetState(RELAYD_STATE_CONNECTED_ALT, RELAYD_SUCCESS);
 }
 
