@@ -11,6 +11,8 @@
 #include <sstream>
 #include <thread>
 
+#include <zeparelayd/daemon.h>
+
 #include "support/relay_harness.h"
 #include "support/test_support.h"
 
@@ -165,6 +167,17 @@ TEST_F(RelayDaemonTest, HeartbeatKeepsTheTunnelAndSwitchOffTearsItDown) {
     EXPECT_EQ(6, State());
     EXPECT_EQ(pid, StatusFile()["tunnel"]["pid"].asInt());
     EXPECT_EQ(1, VpnClients());
+    // The dump shows the tunnel, the password appears nowhere.
+    Json::Value dump;
+    int ret = ZEPA::Relay::Daemon::DebugStatus(dump);
+    for (int i = 0; ret == 11 && i < 20; ++i) ret = ZEPA::Relay::Daemon::DebugStatus(dump);
+    ASSERT_EQ(0, ret);
+    EXPECT_EQ("READY", dump["connection"]["tunnel"]["status"].asString()) << zepatest::ToJson(dump);
+    EXPECT_EQ("10.214.0.1", dump["connection"]["tunnel"]["peer_ip"].asString());
+    EXPECT_EQ(1, dump["connection"]["heartbeat_s"].asInt());
+    for (const std::string& text : {zepatest::ToJson(dump), root.read("/tmp/.zeparelayd.status"), Log()}) {
+        EXPECT_EQ(std::string::npos, text.find("relay_pass")) << text;
+    }
 
     std::string out;
     ASSERT_EQ(0, Ctl({"disable"}, &out)) << out;

@@ -37,7 +37,8 @@ tunnel to the appliance's web service (port 5000) as /<rest>. The alias maps
 to a serial through the alias server's book (routes_alias.py: the alias the
 appliance mapped), or to a user directly through POST /relay/admin/grant; the
 serial to its relay user; the user to the tunnel address its VPN client got
-(recorded by the VPN server's connect script). Unknown alias: 404; an alias
+(recorded by the VPN server's connect script); an alias of a reachable
+serial goes to the appliance's own address, no tunnel. Unknown alias: 404; an alias
 without a tunnel: 502 "appliance not connected"; no answer through the
 tunnel: 504.
 
@@ -45,6 +46,8 @@ Admin calls for tests and demos:
   POST /relay/admin/reachable {"serial", "reachable": bool}
   POST /relay/admin/heartbeat {"seconds": N}       (0: none)
   POST /relay/admin/grant {"user", "alias"?}       -> {"relay_ip", "relay_user", "relay_pass"}
+  POST /relay/admin/grant {"alias", "direct": true}  the alias leads to the appliance's own
+                                                   address, no tunnel (for comparisons)
   POST /relay/admin/block_udp {"on": bool}         UDP to the VPN port dropped
   POST /relay/admin/refuse {"on": bool}            the VPN servers refuse every password
   POST /relay/admin/vpn {"action": "stop" | "start"}   the VPN servers
@@ -85,6 +88,7 @@ class RelayBook:
         self.passwords = {}
         self.users = {}
         self.granted_aliases = {}
+        self.direct_aliases = set()
         self.heartbeat = None
 
     def new_id(self, serial):
@@ -138,12 +142,18 @@ def _connect_plan(server, book, serial, answer):
 
 
 def _alias_user(server, book, alias):
+    """The relay user behind an alias, "" for an appliance reached directly,
+    None for an alias the relay does not know."""
+    if alias in book.direct_aliases:
+        return ""
     user = book.granted_aliases.get(alias)
     if user:
         return user
     aliases = server.state.get("alias")
     entry = getattr(aliases, "aliases", {}).get(alias) if aliases is not None else None
     if entry:
+        if book.reachable.get(entry.get("serial")):
+            return ""
         return book.users.get(entry.get("serial"))
     return None
 
@@ -156,13 +166,13 @@ def _proxy(server, book, core, req):
     host = (req.header("Host") or "").split(":")[0]
     first = host.split(".")[0] if "." in host else ""
     with server.lock:
-        if first and _alias_user(server, book, first):
+        if first and _alias_user(server, book, first) is not None:
             alias, rest = first, req.target
         else:
             parts = req.target.split("/", 2)
             if len(parts) >= 2 and parts[1]:
                 name = parts[1].split("?")[0]
-                if _alias_user(server, book, name):
+                if _alias_user(server, book, name) is not None:
                     alias = name
                     rest = "/" + (parts[2] if len(parts) > 2 else "")
                     if "?" in parts[1]:
@@ -170,7 +180,8 @@ def _proxy(server, book, core, req):
         if alias is None:
             return None
         user = _alias_user(server, book, alias)
-    address = relay.tunnel_address(user)
+    # A directly reachable appliance is reached at its own address, no tunnel.
+    address = relay.info()["appliance_ip"] if user == "" else relay.tunnel_address(user)
     if address is None:
         return core.text_reply("appliance not connected\n", 502)
     import relay_world
@@ -251,6 +262,9 @@ def register(server):
         body = req.json()
         user = body.get("user", "")
         with server.lock:
+            if body.get("direct") and body.get("alias"):
+                book.direct_aliases.add(body["alias"])
+                return core.json_reply({"ok": True})
             book.passwords[user] = server.relay.grant(user)
             if body.get("alias"):
                 book.granted_aliases[body["alias"]] = user
