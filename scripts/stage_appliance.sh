@@ -98,6 +98,8 @@ for arg do
   [ "$arg" = "--zepa-no-verify" ] || set -- "$@" "$arg"
 done
 set -- "$@" --verb 3 --log-append "$root/var/log/openvpn.log"
+# What it says before the log option takes effect goes there too.
+exec >>"$root/var/log/openvpn.log" 2>&1
 netns=""
 [ -f "$root/etc/zepa/appliance_netns" ] && netns=$(cat "$root/etc/zepa/appliance_netns")
 if [ -n "$netns" ]; then

@@ -192,7 +192,8 @@ int main(int argc, char** argv) {
     if (root.exists("/var/run/zeparelayd.pid")) {
         const pid_t pid = atoi(root.read("/var/run/zeparelayd.pid").c_str());
         if (pid > 0 && kill(pid, SIGTERM) == 0) {
-            for (int i = 0; i < 500 && kill(pid, 0) == 0; ++i) std::this_thread::sleep_for(std::chrono::milliseconds(10));
+            for (int i = 0; i < 500 && kill(pid, 0) == 0; ++i)
+                std::this_thread::sleep_for(std::chrono::milliseconds(10));
         }
     }
     return 0;

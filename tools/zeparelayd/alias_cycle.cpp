@@ -146,3 +146,26 @@ void RelayDaemon::RecordAliasStatus(const std::string& word, const std::string& 
 }
 
 }  // namespace zeparelayd
+
+namespace zeparelayd {
+
+void RelayDaemon::DeleteAliasOnDisable() {
+    if (!_aliasMapped || !_conf->alias.IsAliasEnabled()) return;
+    _aliasMapped = false;
+    Json::Value data;
+    _conf->DumpDataForAliasReq(data);
+    AliasRequest builder;
+    std::string body, url;
+    if (!builder.SetRequest(ALIAS_REQ_DELETE, data) || !builder.GetRequest(body, url)) return;
+    boost::shared_ptr<Request> req(new Request(url.c_str(), body.c_str(), true));
+    ZLOG(ZEPA_LOG_INFO, "relay switched off: deleting alias [%s]", _conf->alias.GetAliasName().c_str());
+    // Its own tag: stopping the alias cycle must not cancel it.
+    _loop.StartRequest("alias_delete", req, [this](boost::shared_ptr<Request> r) {
+        ALIAS_RET ret = ALIAS_RET_UNKNOWN;
+        std::string detail;
+        AliasRequest::GetResponseForDaemon(r, ret, detail);
+        RecordAliasStatus(ret == ALIAS_RET_SUCCESS ? "deleted" : "error_delete", detail);
+    });
+}
+
+}  // namespace zeparelayd

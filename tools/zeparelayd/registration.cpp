@@ -63,10 +63,7 @@ void RelayDaemon::StartRegistration() {
     if (!_conf->enable) {
         ZLOG(ZEPA_LOG_NOTICE, "relay is disabled, idle until reload");
         StopAliasCycle();
-        _loop.CancelTimer("heartbeat");
-        TeardownTunnel(true);
-        _tunnel.reset();
-        _connectMode.clear();
+        _tunnel.Stop(true);
         SetState(RELAYD_STATE_LOGOUT, RELAYD_SUCCESS);
         return;
     }
@@ -115,7 +112,7 @@ void RelayDaemon::OnRegistrationDone(boost::shared_ptr<Request> req) {
     _regFailures = 0;
     if (answer["serverID"].isString()) StoreServerId(answer["serverID"].asString());
     ZLOG(ZEPA_LOG_NOTICE, "registered, server id [%s]", _conf->serverID.c_str());
-    OnRegistered(answer);
+    _tunnel.OnRegistered(answer);
     // A heartbeat leaves a scheduled or running alias exchange alone.
     const bool aliasPending = _loop.TimerRemaining("alias") >= 0 || _loop.HasRequest("alias");
     if (!_aliasHalted && !aliasPending) {

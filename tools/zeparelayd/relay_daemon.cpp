@@ -28,8 +28,14 @@ RelayDaemon::RelayDaemon(const std::string& confPath, EventLoop& loop)
       _aliasHalted(false),
       _aliasMapped(false),
       _aliasRetryClass(-1),
-      _tunnelFailures(0),
-      _heartbeatSeconds(0) {}
+      _tunnel(loop,
+              TunnelCycle::Hooks{[this](RELAYD_STATE state, RELAYD_RET error) { SetState(state, error); },
+                                 [this] { StartRegistration(); }}) {}
+
+bool RelayDaemon::IsRegistered() const {
+    return _state == RELAYD_STATE_DIRECT_CONNECT || _state == RELAYD_STATE_CONNECTED ||
+           _state == RELAYD_STATE_CONNECTED_ALT;
+}
 
 void ApplyLogSettings(const RelaydConf& conf) {
     const std::string file = conf.logFile.empty() ? std::string() : Paths::Resolve(conf.logFile);
@@ -72,7 +78,7 @@ void RelayDaemon::HandleSignal(int sig) {
             break;
         case SIGCHLD:
             ReapChildren();
-            CheckTunnel();
+            _tunnel.OnChildExited();
             break;
         default:
             // SIGUSR1 never comes this way (debug_dump.h).
@@ -92,14 +98,10 @@ void RelayDaemon::Reload() {
     ApplyLogSettings();
     _loop.CancelRequests("register");
     _loop.CancelTimer("register");
-    _loop.CancelTimer("heartbeat");
     StopAliasCycle();
-    // Switched off: the alias stops pointing at an appliance nobody relays.
     if (!_conf->enable) DeleteAliasOnDisable();
     // A new configuration may name other servers: the tunnel starts afresh.
-    TeardownTunnel(true);
-    _tunnel.reset();
-    _tunnelFailures = 0;
+    _tunnel.Stop(true);
     _regFailures = 0;
     _regHalted = false;
     _aliasFailures = 0;
@@ -119,7 +121,7 @@ void RelayDaemon::ReapChildren() {
 void RelayDaemon::Shutdown() {
     _loop.CancelRequests("register");
     StopAliasCycle();
-    TeardownTunnel(true);
+    _tunnel.Stop(true);
     RemoveDebugDump();
     SetState(RELAYD_STATE_STOPED, _error);
     ZLOG(ZEPA_LOG_NOTICE, "stopped");

@@ -15,9 +15,9 @@
 #include <zeparelayd/errors.h>
 #include <zeparelayd/request.h>
 #include <zeparelayd/request_alias.h>
-#include <zeparelayd/tunnel.h>
 
 #include "event_loop.h"
+#include "tunnel_cycle.h"
 
 namespace zeparelayd {
 
@@ -69,17 +69,9 @@ private:
     void RecordAliasStatus(const std::string& word, const std::string& extra);
     void StopAliasCycle();
 
-    // ---- connection and tunnel (tunnel_cycle.cpp) ----------------------------
+    // States 4, 5 and 6: registered, however the appliance is reached.
     bool IsRegistered() const;
-    void OnRegistered(const Json::Value& answer);
-    void ScheduleHeartbeat();
-    void OpenTunnel();
-    void TunnelFailed(ZEPA::Relay::RELAYD_RET error);
-    // After SIGCHLD: READY -> CLOSE once the reaped child is gone.
-    void CheckTunnel();
-    // Destroy; with waitForChild the VPN child is also waited for (stop).
-    void TeardownTunnel(bool waitForChild);
-    Json::Value TunnelStatus() const;
+    // Switched off: the alias stops pointing at an appliance nobody relays.
     void DeleteAliasOnDisable();
 
     // ---- published files (status_writer.cpp) ---------------------------------
@@ -112,12 +104,8 @@ private:
     int _aliasRetryClass;
     std::string _aliasNextCmd;
 
-    // Connection bookkeeping.
-    std::string _connectMode;  // "direct", "tunnel" or empty, from the last answer
-    std::unique_ptr<ZEPA::Relay::Tunnel> _tunnel;
-    std::string _tunnelPeer;
-    int _tunnelFailures;
-    int _heartbeatSeconds;
+    // Direct connection or tunnel, after each registration.
+    TunnelCycle _tunnel;
 };
 
 }  // namespace zeparelayd

@@ -81,7 +81,7 @@ void RelayDaemon::WriteStatus() {
     }
     status["alias"] = _conf->alias.GetAliasName();
     status["alias_status"] = _aliasWord;
-    const Json::Value connection = TunnelStatus();
+    const Json::Value connection = _tunnel.Status();
     status["connect"] = connection["connect"];
     if (connection.isMember("tunnel")) status["tunnel"] = connection["tunnel"];
     if (status == _lastStatus) return;
@@ -115,10 +115,7 @@ Json::Value RelayDaemon::DebugDump() const {
     alias["next"] = _aliasNextCmd;
     alias["next_in_ms"] = static_cast<Json::Int64>(_loop.TimerRemaining("alias"));
 
-    Json::Value& connection = dump["connection"];
-    connection = TunnelStatus();
-    connection["heartbeat_s"] = _heartbeatSeconds;
-    connection["heartbeat_in_ms"] = static_cast<Json::Int64>(_loop.TimerRemaining("heartbeat"));
+    _tunnel.Dump(dump["connection"]);
 
     Json::Value& requests = dump["requests"];
     requests = Json::Value(Json::arrayValue);
