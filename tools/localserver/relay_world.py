@@ -239,12 +239,11 @@ class RelayWorld:
             time.sleep(0.02)
         raise RelayWorldError("openvpn %s server not ready after 10 s (see %s)" % (what, log))
 
-    def stop_servers(self):
+    def stop_servers(self, extra=()):
         with self.lock:
-            procs = list(self.servers.values())
+            procs = list(self.servers.values()) + [p for p in extra if p is not None]
             self.servers = {}
-        for proc in procs:
-            _stop(proc)
+        _stop_all(procs)
 
     def _start_web(self):
         web = os.path.join(os.path.dirname(os.path.abspath(__file__)), "appliance_web.py")
@@ -263,10 +262,9 @@ class RelayWorld:
             time.sleep(0.02)
 
     def close(self):
-        self.stop_servers()
-        if self.web is not None:
-            _stop(self.web)
-            self.web = None
+        # Everything is told at once: the local server's owner waits only so long.
+        self.stop_servers(extra=[self.web])
+        self.web = None
         if self.created:
             subprocess.run(["ip", "-force", "-batch", "-"], input="".join("netns del %s\n" % ns for ns in self.created),
                            stdout=subprocess.DEVNULL, stderr=subprocess.DEVNULL, text=True)
@@ -327,11 +325,14 @@ class RelayWorld:
                 "appliance_ip": APPLIANCE_WAN_IP, "work_dir": self.work}
 
 
-def _stop(proc):
-    if proc.poll() is None:
-        proc.send_signal(signal.SIGTERM)
+def _stop_all(procs):
+    for proc in procs:
+        if proc.poll() is None:
+            proc.send_signal(signal.SIGTERM)
+    deadline = time.monotonic() + 3
+    for proc in procs:
         try:
-            proc.wait(5)
+            proc.wait(max(0.0, deadline - time.monotonic()))
         except subprocess.TimeoutExpired:
             proc.kill()
             proc.wait()
