@@ -30,13 +30,11 @@ bool WaitUntil(const std::function<bool()>& cond, int ms) {
     return cond();
 }
 
-class RelayDaemonTest : public zepatest::RootTest {
+class RelayDaemonTest : public zepatest::RelayTest {
 protected:
     void SetUp() override {
-        RootTest::SetUp();
-        const std::string why = zepatest::RelayHarness::Unavailable();
-        if (!why.empty()) GTEST_SKIP() << "real relay tests skipped: " << why;
-        ASSERT_TRUE(relay.Start(root)) << relay.error();
+        RelayTest::SetUp();
+        if (IsSkipped() || HasFatalFailure()) return;
         alias = "box" + std::to_string(getpid());
         std::ostringstream conf;
         conf << "{\n"
@@ -91,7 +89,6 @@ protected:
     }
     std::string Log() { return root.read("/var/log/zeparelayd.log"); }
 
-    zepatest::RelayHarness relay;
     std::string alias;
 };
 

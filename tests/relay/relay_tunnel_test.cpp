@@ -22,13 +22,11 @@ void SleepMs(int ms) {
     nanosleep(&ts, nullptr);
 }
 
-class RelayTunnelTest : public zepatest::RootTest {
+class RelayTunnelTest : public zepatest::RelayTest {
 protected:
     void SetUp() override {
-        RootTest::SetUp();
-        const std::string why = zepatest::RelayHarness::Unavailable();
-        if (!why.empty()) GTEST_SKIP() << "real relay tests skipped: " << why;
-        ASSERT_TRUE(relay.Start(root)) << relay.error();
+        RelayTest::SetUp();
+        if (IsSkipped() || HasFatalFailure()) return;
         zepatest::InstallTunnelSignalHandlers();
         user = "zr" + std::to_string(getpid());
         alias = "box" + std::to_string(getpid());
@@ -76,7 +74,6 @@ protected:
         EXPECT_NE(std::string::npos, body.find("you reached the management page")) << body;
     }
 
-    zepatest::RelayHarness relay;
     Tunnel tunnel;
     std::string user;
     std::string alias;

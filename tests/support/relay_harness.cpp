@@ -33,6 +33,13 @@ bool RunQuiet(const std::string& command) { return system((command + " >/dev/nul
 
 }  // namespace
 
+void RelayTest::SetUp() {
+    RootTest::SetUp();
+    const std::string why = RelayHarness::Unavailable();
+    if (!why.empty()) GTEST_SKIP() << "real relay tests skipped: " << why;
+    ASSERT_TRUE(relay.Start(root)) << relay.error();
+}
+
 int RunProgram(const std::vector<std::string>& args, std::string* out) {
     char tmpl[] = "/tmp/zepa_relay_outXXXXXX";
     const int fd = mkstemp(tmpl);

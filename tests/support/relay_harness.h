@@ -70,6 +70,15 @@ private:
     std::string _error;
 };
 
+// Base fixture of the real-relay tests: a private root with the appliance
+// staged in it and the relay started; skipped, saying why, where the machine
+// cannot host the relay.
+class RelayTest : public RootTest {
+protected:
+    void SetUp() override;
+    RelayHarness relay;
+};
+
 // Runs a program, waits for it and gives its exit status (-1 when it did not
 // exit normally); its standard output goes to out when given.
 int RunProgram(const std::vector<std::string>& args, std::string* out = nullptr);
