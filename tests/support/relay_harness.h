@@ -79,12 +79,6 @@ protected:
     RelayHarness relay;
 };
 
-// Runs a program, waits for it and gives its exit status (-1 when it did not
-// exit normally); its standard output goes to out when given.
-int RunProgram(const std::vector<std::string>& args, std::string* out = nullptr);
-// Names in a folder, one per line.
-std::string ListDir(const std::string& dir);
-
 // Handlers for the signals a tunnel start relies on (SIGCHLD, SIGUSR2,
 // SIGALRM), as the daemon has them.
 void InstallTunnelSignalHandlers();
