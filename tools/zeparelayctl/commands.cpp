@@ -37,6 +37,19 @@ int Status(const Args& args) {
     if (args.size() > 1 || (args.size() == 1 && args[0] != "--debug")) return EXIT_USAGE;
     const bool debug = args.size() == 1;
     const int ret = Daemon::Status(debug);
+    if (ret != 0 || debug) return ret;
+    // How the relay reaches the appliance: the daemon's own part of the file.
+    Json::Value status;
+    if (Daemon::GetStatus(status) != 0 || !status.isObject()) return ret;
+    const Json::Value& connect = status["connect"];
+    if (connect.isString() && !connect.asString().empty()) printf("connect: %s\n", connect.asCString());
+    const Json::Value& tunnel = status["tunnel"];
+    if (tunnel.isObject()) {
+        printf("tunnel: %s, relay %s, peer %s, pid %d\n", tunnel.get("status", "").asString().c_str(),
+               tunnel.get("relay_ip", "").asString().c_str(),
+               tunnel.get("peer_ip", "").asString().empty() ? "--" : tunnel["peer_ip"].asCString(),
+               tunnel.get("pid", -1).isInt() ? tunnel.get("pid", -1).asInt() : -1);
+    }
     return ret;
 }
 

@@ -41,6 +41,9 @@ void RelayDaemon::WriteStatus() {
     _conf->WriteServices(status["service"], true);
     status["alias"] = _conf->alias.GetAliasName();
     status["alias_status"] = _alias.Word();
+    const Json::Value connection = _tunnel.Status();
+    status["connect"] = connection["connect"];
+    if (connection.isMember("tunnel")) status["tunnel"] = connection["tunnel"];
     if (status == _lastStatus) return;
     if (RelaydConf::WriteJsonFile(Daemon::GetStatusPath(), status)) _lastStatus = status;
     NotifyStatus(ServiceStatusLine(GetStateStr(_state), GetErrorStr(_error), _alias.Word()));
@@ -59,6 +62,7 @@ Json::Value RelayDaemon::DebugDump() const {
 
     _registration.Dump(dump["registration"]);
     _alias.Dump(dump["alias"]);
+    _tunnel.Dump(dump["connection"]);
 
     Json::Value& requests = dump["requests"];
     requests = Json::Value(Json::arrayValue);
