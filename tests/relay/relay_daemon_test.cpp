@@ -11,6 +11,8 @@
 #include <sstream>
 #include <thread>
 
+#include <json/reader.h>
+
 #include <zeparelayd/daemon.h>
 
 #include "support/relay_harness.h"
@@ -75,7 +77,16 @@ protected:
         if (!root.exists("/var/run/zeparelayd.pid")) return -1;
         return atoi(root.read("/var/run/zeparelayd.pid").c_str());
     }
-    Json::Value StatusFile() { return zepatest::ParseJson(root.read("/tmp/.zeparelayd.status")); }
+    // The daemon rewrites the file in place: a read that meets it half
+    // written is taken as no status yet, and the polling reads again.
+    Json::Value StatusFile() {
+        Json::Value v(Json::objectValue);
+        Json::Reader reader;
+        if (!reader.parse(root.read("/tmp/.zeparelayd.status"), v, false) || !v.isObject()) {
+            return Json::Value(Json::objectValue);
+        }
+        return v;
+    }
     int State() { return StatusFile()["state"].asInt(); }
     int StartDaemon() {
         return zepatest::RunProgram({kDaemon, "--root", root.dir(), "--ca-file", relay.server().caFile()});
