@@ -11,6 +11,7 @@
 
 #include <zepasdk/sysroot.h>
 
+#include "fake_clock.h"
 #include "retry_policy.h"
 #include "tunnel_cycle.h"
 
@@ -21,20 +22,12 @@ using zeparelayd::TunnelPolicy;
 
 namespace {
 
-class FakeClock : public zeparelayd::Clock {
-public:
-    int64_t NowMs() const override { return _now; }
-    void Advance(int64_t ms) { _now += ms; }
-
-private:
-    int64_t _now = 7000000;
-};
-
 class TunnelPolicyTest : public ::testing::Test {
 protected:
-    FakeClock clock;
-    long jitter = 0;
-    TunnelPolicy policy{clock, [this] { return jitter; }};
+    zepatest::FakeClock clock;
+    zepatest::FixedRandom random;
+    long& jitter = random.value;
+    TunnelPolicy policy{clock, random.Source()};
 };
 
 TEST_F(TunnelPolicyTest, DoublesFromTwoSecondsUpToFiveMinutes) {
