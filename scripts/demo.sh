@@ -2,7 +2,10 @@
 # The relay daemon end to end, on this machine, without touching the system:
 # builds the project, stages a sample appliance in a private folder, starts a
 # local relay/alias server on loopback (HTTPS with a throwaway CA), runs
-# zeparelayd against it and drives it with zeparelayctl.
+# zeparelayd against it and drives it with zeparelayctl. As root it also
+# runs the relay's VPN side (network namespaces, real openvpn servers, the
+# appliance's web UI) and ends by fetching the appliance's page from outside
+# through the relay and the daemon's tunnel.
 #
 #   ./scripts/demo.sh            (as root on a fresh machine: installs packages first)
 #   ZEPA_DEMO_BUILD=DIR ZEPA_DEMO_PREBUILT=1 ./scripts/demo.sh
@@ -136,9 +139,22 @@ rm -rf "$stage"
 say "system files:      $stage/etc/zepainfo.conf (runrelayd=yes), firewall definitions, router rules"
 say "every fixed path of the daemon (config, PID, log, status) lives below this root"
 
+relay_args=()
+relay_why=""
+if [ "$(id -u)" -ne 0 ]; then
+  relay_why="not root (network namespaces and tun devices need root)"
+elif [ ! -e /dev/net/tun ]; then
+  relay_why="no /dev/net/tun on this machine"
+elif ! ip netns add "zepa-demo-probe-$$" 2>/dev/null; then
+  relay_why="network namespaces cannot be created here"
+else
+  ip netns del "zepa-demo-probe-$$"
+  relay_args=(--relay "demo$$" --relay-dir "$stage/relay-side")
+fi
+
 step "4. Local relay control and alias server (HTTPS on loopback, throwaway CA)"
 python3 "$src/tools/localserver/zepa_localserver.py" --ready-file "$stage/tmp/server.json" \
-  --cert-dir "$stage/certs" &
+  --cert-dir "$stage/certs" "${relay_args[@]}" &
 server_pid=$!
 for _ in $(seq 100); do [ -f "$stage/tmp/server.json" ] && break; sleep 0.1; done
 [ -f "$stage/tmp/server.json" ] || { echo "demo: the local server did not start" >&2; exit 1; }
@@ -147,6 +163,15 @@ read -r http_port https_port ca_file < <(py \
   "$stage/tmp/server.json")
 say "control server https://127.0.0.1:$https_port/Serv.php, alias server https://127.0.0.1:$https_port"
 say "its CA ($ca_file) is trusted by the daemon through --ca-file (staging only)"
+if [ ${#relay_args[@]} -gt 0 ]; then
+  echo "zepa-demo$$-a" >"$stage/etc/zepa/appliance_netns"
+  cp "$stage/relay-side/pki/ca.crt" "$stage/usr/zepa/etc/zeparelayd/ca/ca.crt"
+  say "relay side: openvpn servers (UDP and TCP, port 443) at 10.213.0.1 in namespace zepa-demo$$-r,"
+  say "the appliance's network is namespace zepa-demo$$-a with its web UI on port 5000;"
+  say "the staged appliance's openvpn runs there and trusts the relay's throwaway VPN CA"
+else
+  say "relay side skipped: $relay_why; the daemon registers and keeps its alias, but opens no tunnel"
+fi
 
 step "5. The relay configuration points at the local server"
 cat >"$stage/usr/zepa/etc/zeparelayd/zeparelayd.conf" <<CONF
@@ -177,6 +202,10 @@ set -e
 
 step "7. It registers with the control server and maps its alias"
 wait_for 20 "alias_status: good" ctl status
+if [ ${#relay_args[@]} -gt 0 ]; then
+  say "the control server answered \"connect\": \"tunnel\": the daemon opens a VPN tunnel (state 6 once up)"
+  wait_for 60 "tunnel: READY" ctl status
+fi
 ctl status | sed 's/^/      /'
 say "server id stored in the configuration: $(ctl server-id)"
 
@@ -204,14 +233,39 @@ wait_for 10 "state: logout" ctl status
 ctl status | sed 's/^/      /'
 ctl enable | sed 's/^/      /'
 wait_for 20 "state: connected" ctl status
+[ ${#relay_args[@]} -gt 0 ] && wait_for 60 "tunnel: READY" ctl status
 ctl status | sed 's/^/      /'
 
-step "11. Stop the daemon"
+step "11. The appliance's web UI from outside, through the relay"
+if [ ${#relay_args[@]} -gt 0 ]; then
+  url="https://127.0.0.1:$https_port/demo-box/"
+  say "GET $url"
+  say "(the relay's proxy looks up the alias demo-box, finds the tunnel address the appliance's"
+  say " openvpn client got, and forwards the request through the tunnel to port 5000 of the appliance)"
+  python3 - "$url" "$ca_file" <<'PY' | sed 's/^/      /'
+import ssl, sys, urllib.request
+ctx = ssl.create_default_context(cafile=sys.argv[2])
+with urllib.request.urlopen(sys.argv[1], context=ctx, timeout=10) as r:
+    print("HTTP %d, through tunnel address %s" % (r.status, r.headers.get("X-Relay-Tunnel")))
+    print(r.read().decode("utf-8", "replace").strip())
+PY
+  say "that page was served by the staged appliance inside its own network namespace and reached"
+  say "only through the daemon's VPN tunnel"
+else
+  say "skipped: $relay_why."
+  say "as root this step fetches the staged appliance's page through the relay's VPN tunnel"
+fi
+
+step "12. Stop the daemon"
 ctl stop | sed 's/^/      /'
 set +e
 ctl status | sed 's/^/      /'
 set -e
 say "log file: $stage/var/log/zeparelayd.log (last lines)"
 tail -n 5 "$stage/var/log/zeparelayd.log" | sed 's/^/      /'
+
+if [ ${#relay_args[@]} -gt 0 ]; then
+  say "openvpn clients left: $(pgrep -fc -- "$stage/tmp/.tunnel." || true)"
+fi
 
 step "Done: everything started by the demo is stopped again"

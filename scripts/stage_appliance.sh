@@ -74,4 +74,75 @@ CONF
 cat >"$root/etc/zepa/cloudservice.conf" <<'CONF'
 api_key="3b8f1e6c0a9d47e2b5c1f8a04d7e9b2c6a1f3e8d0b4c7a92e5f1d8b3c6a0e4f7"
 CONF
+
+# The tunnel's programs. The appliance ships its own build of the VPN program,
+# which knows the option "--zepa-no-verify"; Debian's openvpn refuses every
+# option it does not know and exits at once ("Unrecognized option"), so the
+# staged /usr/sbin/openvpn drops that one option and runs the real program.
+# The real client still checks the relay's certificate chain against --ca.
+# The staged appliance's network is a network namespace when
+# etc/zepa/appliance_netns names one (the local relay creates it): the real
+# program then runs inside it, through exec, so the tunnel's pid stays the
+# VPN program's own. Its messages go to var/log/openvpn.log.
+mkdir -p "$root/usr/sbin" "$root/usr/zepa/etc.defaults/zeparelayd/scripts" "$root/usr/zepa/etc/zeparelayd/ca"
+cat >"$root/usr/sbin/openvpn" <<'SH'
+#!/bin/sh
+root=$(cd "$(dirname "$0")/../.." && pwd)
+real=/usr/sbin/openvpn
+if [ "$root/usr/sbin/openvpn" -ef "$real" ]; then
+  echo "staged openvpn: refusing to run itself as the real program" >&2
+  exit 1
+fi
+for arg do
+  shift
+  [ "$arg" = "--zepa-no-verify" ] || set -- "$@" "$arg"
+done
+set -- "$@" --verb 3 --log-append "$root/var/log/openvpn.log"
+# What it says before the log option takes effect goes there too.
+exec >>"$root/var/log/openvpn.log" 2>&1
+netns=""
+[ -f "$root/etc/zepa/appliance_netns" ] && netns=$(cat "$root/etc/zepa/appliance_netns")
+if [ -n "$netns" ]; then
+  exec nsenter --net="/run/netns/$netns" "$real" "$@"
+fi
+exec "$real" "$@"
+SH
+chmod 755 "$root/usr/sbin/openvpn"
+
+# Route-up script: openvpn runs it with the daemon's pid once the tunnel's
+# routes are set. It publishes the relay's end of the tunnel ("peer_ip") and
+# the appliance's own tunnel address, then wakes the daemon with SIGUSR2.
+cat >"$root/usr/zepa/etc.defaults/zeparelayd/scripts/up.sh" <<'SH'
+#!/bin/sh
+root=$(cd "$(dirname "$0")/../../../../.." && pwd)
+info="$root/tmp/.zepa_farlink_tunnel_info"
+peer=${ifconfig_remote:-${route_vpn_gateway:-}}
+tmp="$info.$$"
+printf 'peer_ip="%s"\nlocal_ip="%s"\ndev="%s"\n' "$peer" "${ifconfig_local:-}" "${dev:-}" >"$tmp" &&
+  mv -f "$tmp" "$info"
+echo "up pid=$1 peer=$peer local=${ifconfig_local:-}" >>"$root/var/log/tunnel-scripts.log"
+case "$1" in
+  ''|*[!0-9]*|0) exit 0 ;;
+esac
+kill -USR2 "$1"
+SH
+# Down script: the tunnel is gone, so is what the up script published.
+cat >"$root/usr/zepa/etc.defaults/zeparelayd/scripts/down.sh" <<'SH'
+#!/bin/sh
+root=$(cd "$(dirname "$0")/../../../../.." && pwd)
+rm -f "$root/tmp/.zepa_farlink_tunnel_info"
+echo "down $*" >>"$root/var/log/tunnel-scripts.log"
+SH
+chmod 755 "$root/usr/zepa/etc.defaults/zeparelayd/scripts/up.sh" \
+  "$root/usr/zepa/etc.defaults/zeparelayd/scripts/down.sh"
+
+# The module tool loads and unloads the tunnel's kernel modules on the
+# appliance. A developer's machine keeps its own modules: the stand-in only
+# records each call.
+cat >"$root/usr/zepa/bin/iptablestool" <<'SH'
+#!/bin/sh
+root=$(cd "$(dirname "$0")/../../.." && pwd)
+echo "$*" >>"$root/var/log/iptablestool.log"
+SH
+chmod 755 "$root/usr/zepa/bin/iptablestool"
 echo "staged a sample appliance in $root"

@@ -28,33 +28,7 @@ const std::string kDaemon = ZEPA_BINARY_DIR "/tools/zeparelayd/zeparelayd";
 const std::string kCtl = ZEPA_BINARY_DIR "/tools/zeparelayctl/zeparelayctl";
 const std::string kStage = ZEPA_SOURCE_DIR "/scripts/stage_appliance.sh";
 
-// Runs a program, waits for it and gives its exit status (-1 when it did not
-// exit normally); its standard output goes to out, its standard error to err.
-int RunProgram(const std::vector<std::string>& args, std::string* out = nullptr, std::string* err = nullptr) {
-    char tmpl[] = "/tmp/zepa_it_outXXXXXX";
-    int fd = mkstemp(tmpl);
-    char errTmpl[] = "/tmp/zepa_it_errXXXXXX";
-    int errFd = mkstemp(errTmpl);
-    pid_t pid = fork();
-    if (pid == 0) {
-        dup2(fd, 1);
-        if (err != nullptr) dup2(errFd, 2);
-        std::vector<char*> argv;
-        for (const std::string& a : args) argv.push_back(const_cast<char*>(a.c_str()));
-        argv.push_back(nullptr);
-        execv(argv[0], argv.data());
-        _exit(127);
-    }
-    int status = 0;
-    waitpid(pid, &status, 0);
-    close(fd);
-    close(errFd);
-    if (out != nullptr) *out = zepatest::ReadFile(tmpl);
-    if (err != nullptr) *err = zepatest::ReadFile(errTmpl);
-    unlink(tmpl);
-    unlink(errTmpl);
-    return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
-}
+using zepatest::RunProgram;
 
 size_t Append(char* data, size_t size, size_t count, void* out) {
     static_cast<std::string*>(out)->append(data, size * count);

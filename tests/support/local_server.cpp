@@ -125,6 +125,7 @@ void LocalServer::Start(const Options& options) {
     _httpPort = info.get("http_port", 0).asInt();
     _httpsPort = info.get("https_port", 0).asInt();
     _caFile = info.get("ca_file", "").asString();
+    _relay = info.get("relay", Json::Value());
     _ok = _httpPort > 0;
 }
 

@@ -42,6 +42,8 @@ public:
     // The throwaway CA's certificate (PEM).
     const std::string& caFile() const { return _caFile; }
     const std::string& certDir() const { return _certDir; }
+    // The ready file's "relay" object (started with --relay), else null.
+    const Json::Value& relayInfo() const { return _relay; }
 
     // The next count answers of path: status, body and headers.
     bool script(const std::string& path, int status, const std::string& body, int count = 1,
@@ -77,6 +79,7 @@ private:
     std::string _caFile;
     int _httpPort = 0;
     int _httpsPort = 0;
+    Json::Value _relay;
 };
 
 // Decodes a recorded body ("body_base64") into bytes.

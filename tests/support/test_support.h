@@ -70,6 +70,11 @@ bool LogContains(const std::string& captured, const std::string& needle);
 std::string ReadFile(const std::string& path);
 void WriteFile(const std::string& path, const std::string& content, mode_t mode = 0644);
 bool FileExists(const std::string& path);
+// Names in a folder, one per line.
+std::string ListDir(const std::string& dir);
+// Runs a program, waits for it and gives its exit status (-1 when it did not
+// exit normally); its standard output goes to out when given.
+int RunProgram(const std::vector<std::string>& args, std::string* out = nullptr, std::string* err = nullptr);
 void MakeDirs(const std::string& path);
 mode_t FileMode(const std::string& path);
 // Names in path's folder that start with path's name + ".tmp.": temporary

@@ -5,6 +5,7 @@
 #include <cstdlib>
 #include <vector>
 
+#include "fake_clock.h"
 #include "retry_policy.h"
 
 using namespace ZEPA::Relay;
@@ -12,24 +13,10 @@ using zeparelayd::AliasPolicy;
 using zeparelayd::AliasStep;
 using zeparelayd::RegistrationPolicy;
 
+using zepatest::FakeClock;
+using zepatest::FixedRandom;
+
 namespace {
-
-class FakeClock : public zeparelayd::Clock {
-public:
-    int64_t NowMs() const override { return _now; }
-    void Advance(int64_t ms) { _now += ms; }
-
-private:
-    int64_t _now = 5000000;
-};
-
-// A jitter source that gives the value the test sets.
-struct FixedRandom {
-    long value = 0;
-    zeparelayd::RandomSource Source() {
-        return [this] { return value; };
-    }
-};
 
 class RegistrationPolicyTest : public ::testing::Test {
 protected:

@@ -6,7 +6,9 @@
 
 #include "server_answer.h"
 
+using zeparelayd::AnswerInt;
 using zeparelayd::AnswerObject;
+using zeparelayd::AnswerSection;
 using zeparelayd::AnswerString;
 
 namespace {
@@ -58,6 +60,22 @@ TEST(ServerAnswer, DeepNestingIsNoObject) {
     EXPECT_FALSE(AnswerObject(value).isObject());
     std::string id;
     EXPECT_FALSE(AnswerString(value, "serverID", id));
+}
+
+TEST(ServerAnswer, IntegersAndSectionsAreTypeChecked) {
+    int beat = -1;
+    EXPECT_TRUE(AnswerInt(Parse(R"({"heartbeat": 30})"), "heartbeat", beat));
+    EXPECT_EQ(30, beat);
+    EXPECT_FALSE(AnswerInt(Parse(R"({"heartbeat": "30"})"), "heartbeat", beat));
+    EXPECT_FALSE(AnswerInt(Parse(R"({"heartbeat": 1e30})"), "heartbeat", beat));
+    EXPECT_FALSE(AnswerInt(Parse(R"([1, 2])"), "heartbeat", beat));
+    EXPECT_EQ(30, beat);
+
+    const Json::Value tunnel = AnswerSection(Parse(R"([{"tunnel": {"relay_ip": "10.0.0.1"}}])"), "tunnel");
+    EXPECT_EQ("10.0.0.1", tunnel["relay_ip"].asString());
+    EXPECT_TRUE(AnswerSection(Parse(R"({"tunnel": ["10.0.0.1"]})"), "tunnel").isObject());
+    EXPECT_TRUE(AnswerSection(Parse(R"({"tunnel": ["10.0.0.1"]})"), "tunnel").empty());
+    EXPECT_TRUE(AnswerSection(Parse(R"("tunnel")"), "tunnel").empty());
 }
 
 }  // namespace

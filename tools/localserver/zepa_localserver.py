@@ -178,11 +178,18 @@ class LocalServer:
         self.http_port = 0
         self.https_port = 0
         self.ca_file = ""
+        self.fallbacks = []
+        # The relay's VPN side (relay_world.RelayWorld) when started with --relay.
+        self.relay = None
 
     # ---- extension interface ------------------------------------------------
     def route(self, path, handler, methods=None):
         """Serve path (exact match, no query) with handler(req) -> Reply."""
         self.routes[path] = (handler, set(m.upper() for m in methods) if methods else None)
+
+    def fallback(self, handler):
+        """handler(req) -> Reply or None, asked in order for a path no route serves."""
+        self.fallbacks.append(handler)
 
     def on_reset(self, func):
         """func() runs on POST /_control/reset."""
@@ -223,6 +230,10 @@ class LocalServer:
             return scripted
         entry = self.routes.get(req.path)
         if entry is None:
+            for handler in self.fallbacks:
+                reply = handler(req)
+                if reply is not None:
+                    return reply
             return text_reply("no route for %s\n" % req.path, 404)
         handler, methods = entry
         if methods is not None and req.method not in methods:
@@ -427,6 +438,10 @@ def main(argv=None):
                         help="folder of routes_*.py modules (default: beside this program)")
     parser.add_argument("--no-https", action="store_true", help="serve plain HTTP only")
     parser.add_argument("--verbose", action="store_true", help="log every request to standard error")
+    parser.add_argument("--relay", metavar="NAME", help="also run the relay's VPN side (root): network "
+                        "namespaces zepa-NAME-r and zepa-NAME-a, openvpn servers, the appliance's web service")
+    parser.add_argument("--relay-dir", help="work folder of the relay's VPN side (default: a temporary "
+                        "folder removed at exit)")
     args = parser.parse_args(argv)
 
     # A stop request may come at any moment, even while the certificates are
@@ -441,6 +456,22 @@ def main(argv=None):
 
     app = LocalServer()
     app.verbose = args.verbose
+    relay_temp = None
+    if args.relay:
+        import relay_world
+        relay_dir = args.relay_dir
+        if relay_dir is None:
+            relay_temp = tempfile.TemporaryDirectory(prefix="zepa_relay_")
+            relay_dir = relay_temp.name
+        app.relay = relay_world.RelayWorld(args.relay, relay_dir, args.verbose)
+        try:
+            app.relay.start()
+            if stop.is_set():
+                raise relay_world.RelayWorldError("stopped during set-up")
+        except (relay_world.RelayWorldError, OSError, subprocess.SubprocessError) as exc:
+            app.relay.close()
+            sys.stderr.write("localserver: the relay side could not start: %s\n" % exc)
+            return 3
     load_routes(app, args.routes_dir)
 
     temp_dir = None
@@ -464,8 +495,11 @@ def main(argv=None):
     for t in threads:
         t.start()
 
-    write_ready(args.ready_file, {"http_port": app.http_port, "https_port": app.https_port,
-                                  "ca_file": app.ca_file, "pid": os.getpid()})
+    ready = {"http_port": app.http_port, "https_port": app.https_port, "ca_file": app.ca_file,
+             "pid": os.getpid()}
+    if app.relay is not None:
+        ready["relay"] = app.relay.info()
+    write_ready(args.ready_file, ready)
     while not stop.wait(0.2):
         pass
 
@@ -473,6 +507,10 @@ def main(argv=None):
     for l in listeners:
         l.shutdown()
         l.server_close()
+    if app.relay is not None:
+        app.relay.close()
+    if relay_temp is not None:
+        relay_temp.cleanup()
     if temp_dir is not None:
         temp_dir.cleanup()
     return 0

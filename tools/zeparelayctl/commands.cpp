@@ -103,6 +103,19 @@ StatusView ReadStatus() {
     return view;
 }
 
+// How the relay reaches the appliance: the daemon's own part of the file.
+void PrintConnection(const Json::Value& file) {
+    const Json::Value& connect = file["connect"];
+    if (connect.isString() && !connect.asString().empty()) printf("connect: %s\n", connect.asCString());
+    const Json::Value& tunnel = file["tunnel"];
+    if (tunnel.isObject()) {
+        printf("tunnel: %s, relay %s, peer %s, pid %d\n", tunnel.get("status", "").asString().c_str(),
+               tunnel.get("relay_ip", "").asString().c_str(),
+               tunnel.get("peer_ip", "").asString().empty() ? "--" : tunnel["peer_ip"].asCString(),
+               tunnel.get("pid", -1).isInt() ? tunnel.get("pid", -1).asInt() : -1);
+    }
+}
+
 int StatusText() {
     const StatusView view = ReadStatus();
     if (view.result == EXIT_BROKEN_STATUS) {
@@ -115,16 +128,17 @@ int StatusText() {
     if (view.error != "success") printf("error: %s\n", view.error.c_str());
     if (view.file["config_error"].isString())
         printf("config_error: %s\n", view.file["config_error"].asCString());
+    PrintConnection(view.file);
     return view.result;
 }
 
 // The status as one JSON object:
 //   {"state", "error", "serverID", "alias", "alias_status", "services", "pid"
-//    [, "tunnel"] [, "config_error"]}
+//    [, "connect"] [, "tunnel"] [, "config_error"]}
 // "state" and "error" are the words of the status readers ("connected",
 // "err_auth", ...), null when the status file is broken; "services" lists the
-// relayed service ids; "pid" is the daemon's process id or null; "tunnel" and
-// "config_error" are copied from the status file when the daemon writes them.
+// relayed service ids; "pid" is the daemon's process id or null; "connect",
+// "tunnel" and "config_error" are copied from the status file when the daemon writes them.
 int StatusJson() {
     const StatusView view = ReadStatus();
     const bool broken = view.result == EXIT_BROKEN_STATUS;
@@ -141,7 +155,7 @@ int StatusJson() {
             if (s.isObject() && s["id"].isString()) out["services"].append(s["id"]);
         }
         out["pid"] = view.file["pid"];
-        for (const char* key : {"tunnel", "config_error"}) {
+        for (const char* key : {"connect", "tunnel", "config_error"}) {
             if (view.file.isMember(key)) out[key] = view.file[key];
         }
     }

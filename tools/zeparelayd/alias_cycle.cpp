@@ -15,6 +15,7 @@ namespace zeparelayd {
 namespace {
 
 const char TAG[] = "alias";
+const char DELETE_TAG[] = "alias_delete";
 
 const char* CommandWord(ALIAS_REQUEST_CMD cmd) {
     return cmd == ALIAS_REQ_MAP ? "map" : cmd == ALIAS_REQ_KEEP_ALIVE ? "keep_alive" : "other";
@@ -110,6 +111,25 @@ void AliasCycle::OnDone(ALIAS_REQUEST_CMD cmd, boost::shared_ptr<Request> req) {
     const int polling = ret == ALIAS_RET_SUCCESS ? _conf.alias.GetPollingTime() : 0;
     Follow(_policy.OnOutcome(cmd, ret, _conf.alias.GetPollSeconds(), polling),
            ret == ALIAS_RET_SUCCESS ? "success" : "failure");
+}
+
+bool AliasCycle::Pending() const { return _loop.TimerRemaining(TAG) >= 0 || _loop.HasRequest(TAG); }
+
+void AliasCycle::DeleteOnDisable() {
+    if (!_policy.Mapped() || !_conf.alias.IsAliasEnabled()) return;
+    Json::Value data;
+    _conf.DumpDataForAliasReq(data);
+    AliasRequest builder;
+    std::string body, url;
+    if (!builder.SetRequest(ALIAS_REQ_DELETE, data) || !builder.GetRequest(body, url)) return;
+    boost::shared_ptr<Request> req(new Request(url.c_str(), body.c_str(), true));
+    RLOG(LOG_INFO, "relay switched off: deleting alias [%s]", _conf.alias.GetAliasName().c_str());
+    _loop.StartRequest(DELETE_TAG, req, [this](boost::shared_ptr<Request> r) {
+        ALIAS_RET ret = ALIAS_RET_UNKNOWN;
+        std::string detail;
+        AliasRequest::GetResponseForDaemon(r, ret, detail);
+        Record(ret == ALIAS_RET_SUCCESS ? "deleted" : "error_delete", detail);
+    });
 }
 
 void AliasCycle::Record(const std::string& word, const std::string& extra) {

@@ -37,6 +37,12 @@ public:
     void Stop();
     // After a reload: counts and halts start afresh; waits for the next registration.
     void Reset();
+    // The relay was switched off: a mapped alias is deleted, so that it stops
+    // pointing at an appliance nobody relays. Runs under its own tag, which
+    // Stop() leaves alone.
+    void DeleteOnDisable();
+    // An exchange is running or scheduled (a heartbeat leaves it alone).
+    bool Pending() const;
 
     // The word of the last outcome, as the status shows it.
     const std::string& Word() const { return _word; }

@@ -52,7 +52,7 @@ void RegistrationCycle::Restart() {
     Start();
 }
 
-void RegistrationCycle::Start() {
+void RegistrationCycle::Start(bool keepState) {
     Stop();
     if (!_conf.enable) {
         RLOG(LOG_NOTICE, "relay is disabled, idle until reload");
@@ -62,7 +62,7 @@ void RegistrationCycle::Start() {
     }
     const std::string url = _conf.serverControl.GetUrl(nullptr);
     boost::shared_ptr<Request> req(new Request(url, Body(), true));
-    SetState(RELAYD_STATE_LOGIN, _error);
+    if (!keepState) SetState(RELAYD_STATE_LOGIN, _error);
     if (url.empty() || !_loop.StartRequest(TAG, req, [this](boost::shared_ptr<Request> r) { OnDone(r); })) {
         RLOG(LOG_ERR, "cannot send registration to [%s]", url.c_str());
         _policy.OnFailure(RELAYD_ERR_CONFIG);
@@ -116,9 +116,13 @@ void RegistrationCycle::OnDone(boost::shared_ptr<Request> req) {
     _policy.OnSuccess();
     std::string id;
     if (AnswerString(answer, "serverID", id)) StoreServerId(id);
-    SetState(RELAYD_STATE_CONNECTED, RELAYD_SUCCESS);
     RLOG(LOG_NOTICE, "registered, server id [%s]", _conf.serverID.c_str());
-    if (_hooks.registered) _hooks.registered();
+    _error = RELAYD_SUCCESS;
+    if (_hooks.registered) {
+        _hooks.registered(answer);
+    } else {
+        SetState(RELAYD_STATE_CONNECTED, RELAYD_SUCCESS);
+    }
 }
 
 void RegistrationCycle::StoreServerId(const std::string& id) {

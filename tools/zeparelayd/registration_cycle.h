@@ -28,16 +28,19 @@ public:
     struct Hooks {
         // The daemon's state changed: write it out.
         std::function<void(ZEPA::Relay::RELAYD_STATE, ZEPA::Relay::RELAYD_RET)> setState;
-        // Registered (state "connected"): the alias may follow.
-        std::function<void()> registered;
+        // Registered: the answer says how the appliance is reached ("connect",
+        // "tunnel", "heartbeat"); the hook sets the state (4, 5 or 6) and the
+        // alias may follow. Without a hook the state is 5.
+        std::function<void(const Json::Value& answer)> registered;
         // The relay is switched off: everything else stops too.
         std::function<void()> disabled;
     };
 
     RegistrationCycle(ZEPA::Relay::RelaydConf& conf, EventLoop& loop, const Clock& clock, Hooks hooks);
 
-    // Registers now (or idles when the relay is switched off).
-    void Start();
+    // Registers now (or idles when the relay is switched off). keepState: a
+    // heartbeat while registered, the state stays as it is meanwhile.
+    void Start(bool keepState = false);
     // Drops the running exchange and the retry timer.
     void Stop();
     // After a reload: counts and halts start afresh, then Start().

@@ -6,6 +6,8 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <cstdlib>
+
 #include <zeparelayd/daemon.h>
 
 #include "config_check.h"
@@ -25,10 +27,27 @@ RelayDaemon::RelayDaemon(const std::string& confPath, EventLoop& loop, const Clo
       _error(RELAYD_SUCCESS),
       _registration(*_conf, loop, clock,
                     RegistrationCycle::Hooks{[this](RELAYD_STATE s, RELAYD_RET e) { SetState(s, e); },
-                                             [this] { _alias.OnRegistered(); }, [this] { _alias.Stop(); }}),
-      _alias(
-          *_conf, loop, clock,
-          AliasCycle::Hooks{[this] { return _state == RELAYD_STATE_CONNECTED; }, [this] { WriteStatus(); }}) {
+                                             [this](const Json::Value& answer) { OnRegistered(answer); },
+                                             [this] {
+                                                 _alias.Stop();
+                                                 _tunnel.Stop(true);
+                                             }}),
+      _alias(*_conf, loop, clock,
+             AliasCycle::Hooks{[this] { return IsRegistered(); }, [this] { WriteStatus(); }}),
+      _tunnel(loop, clock,
+              TunnelCycle::Hooks{[this](RELAYD_STATE s, RELAYD_RET e) { SetState(s, e); },
+                                 [this] { _registration.Start(IsRegistered()); }},
+              [] { return random(); }) {}
+
+bool RelayDaemon::IsRegistered() const {
+    return _state == RELAYD_STATE_DIRECT_CONNECT || _state == RELAYD_STATE_CONNECTED ||
+           _state == RELAYD_STATE_CONNECTED_ALT;
+}
+
+void RelayDaemon::OnRegistered(const Json::Value& answer) {
+    _tunnel.OnRegistered(answer);
+    // A heartbeat leaves a scheduled or running alias exchange alone.
+    if (!_alias.Pending()) _alias.OnRegistered();
 }
 
 int ReopenLogSignal() { return SIGRTMIN + 2; }
@@ -79,6 +98,7 @@ void RelayDaemon::HandleSignal(int sig) {
             break;
         case SIGCHLD:
             ReapChildren();
+            _tunnel.OnChildExited();
             break;
         default:
             // SIGUSR1 comes this way only before the dump handler took it over
@@ -110,7 +130,10 @@ void RelayDaemon::Reload() {
     }
     _configError.clear();
     ApplyLogSettings();
+    if (!_conf->enable) _alias.DeleteOnDisable();
     _alias.Reset();
+    // A new configuration may name other servers: the tunnel starts afresh.
+    _tunnel.Stop(true);
     _registration.Restart();
 }
 
@@ -126,6 +149,7 @@ void RelayDaemon::Shutdown() {
     NotifyStopping();
     _registration.Stop();
     _alias.Stop();
+    _tunnel.Stop(true);
     RemoveDebugDump();
     SetState(RELAYD_STATE_STOPED, _error);
     RLOG(LOG_NOTICE, "stopped");

@@ -5,8 +5,8 @@
 // The cycles:
 //   - RegistrationCycle: the control server learns our identity and services;
 //   - AliasCycle: the public alias stays registered once we are;
-//   - a tunnel cycle joins here the same way: wired in the constructor, told
-//     about registration and reload, and given its part of the debug dump.
+//   - TunnelCycle: how the appliance is reached after each registration
+//     (directly, or through a VPN tunnel to the relay).
 #ifndef ZEPARELAYD_TOOL_RELAY_DAEMON_H
 #define ZEPARELAYD_TOOL_RELAY_DAEMON_H
 
@@ -22,6 +22,7 @@
 #include "clock.h"
 #include "event_loop.h"
 #include "registration_cycle.h"
+#include "tunnel_cycle.h"
 
 namespace zeparelayd {
 
@@ -37,13 +38,15 @@ void ApplyLogSettings(const ZEPA::Relay::RelaydConf& conf);
 //   2 "starting"   configuration loaded, nothing sent yet
 //   3 "login"      registering with the control server, or waiting to retry
 //                  ("error" tells why the last attempt failed)
+//   4 "direct_connect"  registered; the control server reaches the appliance
+//                  directly, no tunnel
 //   5 "connected"  registered: the control server knows the services and
-//                  gave the server id
+//                  gave the server id (no connection word in its answer, or
+//                  a tunnel being opened)
+//   6 "connected"  registered and the VPN tunnel to the relay is up
 //   7 "logout"     the relay is switched off ("runrelayd" is not "yes"); the
 //                  daemon idles until the next reload
 //   8 "stoped"     the daemon has stopped (written last, on the way out)
-// 4 "direct_connect" and 6 (the tunnel's "connected") are not used yet: this
-// daemon does not open a tunnel.
 class RelayDaemon {
 public:
     RelayDaemon(const std::string& confPath, EventLoop& loop, const Clock& clock);
@@ -63,6 +66,9 @@ public:
 private:
     void Reload();
     void ReapChildren();
+    // States 4, 5 and 6: registered, however the appliance is reached.
+    bool IsRegistered() const;
+    void OnRegistered(const Json::Value& answer);
 
     // ---- published files (status_writer.cpp) ---------------------------------
     void SetState(ZEPA::Relay::RELAYD_STATE state, ZEPA::Relay::RELAYD_RET error);
@@ -81,6 +87,7 @@ private:
     std::string _configError;
     RegistrationCycle _registration;
     AliasCycle _alias;
+    TunnelCycle _tunnel;
 };
 
 }  // namespace zeparelayd

@@ -162,4 +162,33 @@ void AliasPolicy::Dump(Json::Value& out) const {
     out["next_in_ms"] = static_cast<Json::Int64>(RemainingMs());
 }
 
+// ---- tunnel ------------------------------------------------------------------
+
+TunnelPolicy::TunnelPolicy(const Clock& clock, RandomSource random)
+    : _random(std::move(random)), _due(clock), _failures(0) {}
+
+int64_t TunnelPolicy::BackoffMs(int n) const {
+    const int64_t delay = Doubling(FIRST_DELAY_MS, n, MAX_DELAY_MS);
+    return delay + Jitter(_random, delay / 4);
+}
+
+int64_t TunnelPolicy::OnFailure() {
+    ++_failures;
+    const int64_t delay = BackoffMs(_failures);
+    _due.Arm(delay);
+    return delay;
+}
+
+void TunnelPolicy::OnUp() {
+    _failures = 0;
+    _due.Clear();
+}
+
+void TunnelPolicy::Reset() { OnUp(); }
+
+void TunnelPolicy::Dump(Json::Value& out) const {
+    out["failures"] = _failures;
+    out["retry_in_ms"] = static_cast<Json::Int64>(RemainingMs());
+}
+
 }  // namespace zeparelayd

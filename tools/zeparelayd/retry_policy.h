@@ -146,6 +146,37 @@ private:
     int _retryClass;
 };
 
+// Reconnecting a tunnel that failed to open or closed later: register again
+// (which also fetches fresh credentials) after 2 s doubling per consecutive
+// failure up to 5 min, plus up to a quarter of the wait as jitter. A tunnel
+// that comes up, or an answer without a tunnel, starts the count afresh.
+class TunnelPolicy {
+public:
+    static constexpr int64_t FIRST_DELAY_MS = 2000;
+    static constexpr int64_t MAX_DELAY_MS = 300000;
+
+    TunnelPolicy(const Clock& clock, RandomSource random);
+
+    // The tunnel failed: the wait before registering again.
+    int64_t OnFailure();
+    void OnUp();
+    // Registering again now, or the cycle stops: nothing is due any more.
+    void OnAttempt() { _due.Clear(); }
+    void Reset();
+
+    int Failures() const { return _failures; }
+    int64_t RemainingMs() const { return _due.RemainingMs(); }
+    void Dump(Json::Value& out) const;
+
+    // The wait for the n-th consecutive failure (n >= 1), with jitter.
+    int64_t BackoffMs(int n) const;
+
+private:
+    RandomSource _random;
+    Deadline _due;
+    int _failures;
+};
+
 }  // namespace zeparelayd
 
 #endif

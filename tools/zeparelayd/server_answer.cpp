@@ -16,4 +16,19 @@ bool AnswerString(const Json::Value& answer, const char* key, std::string& out) 
     return true;
 }
 
+bool AnswerInt(const Json::Value& answer, const char* key, int& out) {
+    const Json::Value& object = AnswerObject(answer);
+    if (!object.isObject()) return false;
+    const Json::Value& value = object[key];
+    if (!value.isInt()) return false;
+    out = value.asInt();
+    return true;
+}
+
+Json::Value AnswerSection(const Json::Value& answer, const char* key) {
+    const Json::Value& object = AnswerObject(answer);
+    if (object.isObject() && object[key].isObject()) return object[key];
+    return Json::Value(Json::objectValue);
+}
+
 }  // namespace zeparelayd

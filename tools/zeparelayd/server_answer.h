@@ -19,6 +19,14 @@ const Json::Value& AnswerObject(const Json::Value& answer);
 // it is missing or not a string.
 bool AnswerString(const Json::Value& answer, const char* key, std::string& out);
 
+// The integer member key of the answer's object; false (out untouched) when
+// it is missing or not an integer that fits an int.
+bool AnswerInt(const Json::Value& answer, const char* key, int& out);
+
+// The object member key of the answer's object; an empty object when it is
+// missing or not an object.
+Json::Value AnswerSection(const Json::Value& answer, const char* key);
+
 }  // namespace zeparelayd
 
 #endif

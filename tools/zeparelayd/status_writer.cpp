@@ -42,6 +42,9 @@ void RelayDaemon::WriteStatus() {
     status["alias"] = _conf->alias.GetAliasName();
     status["alias_status"] = _alias.Word();
     if (!_configError.empty()) status["config_error"] = _configError;
+    const Json::Value connection = _tunnel.Status();
+    status["connect"] = connection["connect"];
+    if (connection.isMember("tunnel")) status["tunnel"] = connection["tunnel"];
     if (status == _lastStatus) return;
     if (RelaydConf::WriteJsonFile(Daemon::GetStatusPath(), status)) _lastStatus = status;
     NotifyStatus(ServiceStatusLine(GetStateStr(_state), GetErrorStr(_error), _alias.Word()));
@@ -60,6 +63,7 @@ Json::Value RelayDaemon::DebugDump() const {
 
     _registration.Dump(dump["registration"]);
     _alias.Dump(dump["alias"]);
+    _tunnel.Dump(dump["connection"]);
 
     Json::Value& requests = dump["requests"];
     requests = Json::Value(Json::arrayValue);

@@ -1,0 +1,231 @@
+// The real daemon with the real relay: registration, then a direct
+// connection or a VPN tunnel as the control server says, the appliance's page
+// fetched through the relay, the tunnel's loss and return, switch-off and
+// stop leaving nothing behind.
+#include <signal.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <functional>
+#include <sstream>
+#include <thread>
+
+#include <json/reader.h>
+
+#include <zeparelayd/daemon.h>
+
+#include "support/relay_harness.h"
+#include "support/test_support.h"
+
+namespace {
+
+const std::string kDaemon = ZEPA_BINARY_DIR "/tools/zeparelayd/zeparelayd";
+const std::string kCtl = ZEPA_BINARY_DIR "/tools/zeparelayctl/zeparelayctl";
+
+bool WaitUntil(const std::function<bool()>& cond, int ms) {
+    const auto end = std::chrono::steady_clock::now() + std::chrono::milliseconds(ms);
+    while (std::chrono::steady_clock::now() < end) {
+        if (cond()) return true;
+        std::this_thread::sleep_for(std::chrono::milliseconds(50));
+    }
+    return cond();
+}
+
+class RelayDaemonTest : public zepatest::RelayTest {
+protected:
+    void SetUp() override {
+        RelayTest::SetUp();
+        if (IsSkipped() || HasFatalFailure()) return;
+        alias = "box" + std::to_string(getpid());
+        std::ostringstream conf;
+        conf << "{\n"
+             << "  \"server_control\": {\"protocol\": \"https\", \"host\": \"127.0.0.1\", \"port\": "
+             << relay.server().httpsPort() << "},\n"
+             << "  \"server_alias\": {\"alias\": \"" << alias << "\", \"url\": \""
+             << relay.server().httpsUrl() << "\"},\n"
+             << "  \"service\": [{\"id\": \"nos\"}],\n"
+             << "  \"log_level\": 7,\n"
+             << "  \"log_file\": \"/var/log/zeparelayd.log\"\n"
+             << "}\n";
+        root.write("/usr/zepa/etc/zeparelayd/zeparelayd.conf", conf.str());
+    }
+
+    void TearDown() override {
+        const pid_t pid = DaemonPid();
+        if (pid > 0 && kill(pid, 0) == 0) {
+            kill(pid, SIGTERM);
+            if (!WaitUntil([&] { return kill(pid, 0) != 0; }, 8000)) kill(pid, SIGKILL);
+        }
+        RootTest::TearDown();
+    }
+
+    int Ctl(const std::vector<std::string>& args, std::string* out = nullptr) {
+        std::vector<std::string> all = {kCtl, "--root", root.dir()};
+        all.insert(all.end(), args.begin(), args.end());
+        return zepatest::RunProgram(all, out);
+    }
+    std::string CtlStatus() {
+        std::string out;
+        Ctl({"status"}, &out);
+        return out;
+    }
+    bool StatusHas(const std::string& text, int ms = 20000) {
+        return WaitUntil([&] { return CtlStatus().find(text) != std::string::npos; }, ms);
+    }
+    pid_t DaemonPid() {
+        if (!root.exists("/var/run/zeparelayd.pid")) return -1;
+        return atoi(root.read("/var/run/zeparelayd.pid").c_str());
+    }
+    // The daemon rewrites the file in place: a read that meets it half
+    // written is taken as no status yet, and the polling reads again.
+    Json::Value StatusFile() {
+        Json::Value v(Json::objectValue);
+        Json::Reader reader;
+        if (!reader.parse(root.read("/tmp/.zeparelayd.status"), v, false) || !v.isObject()) {
+            return Json::Value(Json::objectValue);
+        }
+        return v;
+    }
+    int State() { return StatusFile()["state"].asInt(); }
+    int StartDaemon() {
+        return zepatest::RunProgram({kDaemon, "--root", root.dir(), "--ca-file", relay.server().caFile()});
+    }
+    int VpnClients() { return zepatest::RelayHarness::CountProcesses(root.dir() + "/tmp/.tunnel."); }
+    std::string Page() {
+        std::string body;
+        long status = 0;
+        relay.HttpsGet("/" + alias + "/", body, status);
+        return std::to_string(status) + " " + body;
+    }
+    std::string Log() { return root.read("/var/log/zeparelayd.log"); }
+
+    std::string alias;
+};
+
+TEST_F(RelayDaemonTest, TunnelComesUpIsShownAndCarriesThePageAndComesBackAfterALoss) {
+    ASSERT_EQ(0, StartDaemon());
+    ASSERT_TRUE(StatusHas("tunnel: READY")) << CtlStatus() << Log();
+    const std::string status = CtlStatus();
+    EXPECT_NE(std::string::npos, status.find("state: connected")) << status;
+    EXPECT_NE(std::string::npos, status.find("connect: tunnel")) << status;
+    EXPECT_NE(std::string::npos, status.find("peer 10.214.0.1")) << status;
+    Json::Value file = StatusFile();
+    EXPECT_EQ(6, file["state"].asInt());
+    EXPECT_EQ("READY", file["tunnel"]["status"].asString());
+    EXPECT_EQ(relay.relayIp, file["tunnel"]["relay_ip"].asString());
+    EXPECT_GT(file["tunnel"]["pid"].asInt(), 0);
+    EXPECT_FALSE(file["tunnel"].isMember("relay_pass"));
+    const int firstPid = file["tunnel"]["pid"].asInt();
+    ASSERT_TRUE(StatusHas("alias_status: good"));
+
+    const std::string page = Page();
+    EXPECT_EQ(0u, page.find("200 ")) << page;
+    EXPECT_NE(std::string::npos, page.find("you reached the management page")) << page;
+
+    // The relay's VPN servers go away: the daemon notices (SIGCHLD), reports
+    // the loss and, once they are back, opens a new tunnel by itself.
+    ASSERT_TRUE(relay.Vpn("stop"));
+    ASSERT_TRUE(WaitUntil([&] { return State() == 3; }, 15000)) << CtlStatus();
+    EXPECT_EQ(6, StatusFile()["error"].asInt()) << "err_network";
+    ASSERT_TRUE(relay.Vpn("start"));
+    ASSERT_TRUE(WaitUntil([&] { return State() == 6; }, 40000)) << CtlStatus() << Log();
+    EXPECT_NE(firstPid, StatusFile()["tunnel"]["pid"].asInt());
+    EXPECT_NE(std::string::npos, Log().find("tunnel to [" + relay.relayIp + "] closed"));
+    EXPECT_EQ(0u, Page().find("200 "));
+
+    // Stop: no VPN client, pass file or tunnel info file stays behind.
+    std::string out;
+    EXPECT_EQ(0, Ctl({"stop"}, &out)) << out;
+    EXPECT_EQ(0, VpnClients());
+    EXPECT_FALSE(root.exists("/tmp/.zepa_farlink_tunnel_info"));
+    EXPECT_EQ(8, State());
+    for (const std::string& name : {std::string("/tmp")}) {
+        const std::string listing = zepatest::ListDir(root.path(name));
+        EXPECT_EQ(std::string::npos, listing.find(".tunnel.")) << listing;
+    }
+    EXPECT_EQ(0, relay.Stop());
+    EXPECT_FALSE(relay.NamespacesExist());
+}
+
+TEST_F(RelayDaemonTest, ReachableApplianceConnectsDirectly) {
+    Json::Value body;
+    body["serial"] = "2150ZSN012345";
+    body["reachable"] = true;
+    ASSERT_TRUE(relay.Admin("POST", "/relay/admin/reachable", body)["ok"].asBool());
+    ASSERT_EQ(0, StartDaemon());
+    ASSERT_TRUE(StatusHas("state: direct_connect")) << CtlStatus() << Log();
+    EXPECT_NE(std::string::npos, CtlStatus().find("connect: direct"));
+    EXPECT_EQ(4, State());
+    EXPECT_FALSE(StatusFile().isMember("tunnel"));
+    EXPECT_EQ(0, VpnClients());
+    EXPECT_TRUE(StatusHas("alias_status: good"));
+}
+
+TEST_F(RelayDaemonTest, HeartbeatKeepsTheTunnelAndSwitchOffTearsItDown) {
+    Json::Value beat;
+    beat["seconds"] = 1;
+    ASSERT_TRUE(relay.Admin("POST", "/relay/admin/heartbeat", beat)["ok"].asBool());
+    ASSERT_EQ(0, StartDaemon());
+    ASSERT_TRUE(StatusHas("tunnel: READY")) << CtlStatus() << Log();
+    const int pid = StatusFile()["tunnel"]["pid"].asInt();
+    ASSERT_TRUE(StatusHas("alias_status: good"));
+    // Registrations go on while the tunnel stays the same.
+    ASSERT_TRUE(WaitUntil([&] { return relay.server().requests("/Serv.php").size() >= 3; }, 15000));
+    EXPECT_EQ(6, State());
+    EXPECT_EQ(pid, StatusFile()["tunnel"]["pid"].asInt());
+    EXPECT_EQ(1, VpnClients());
+    // The dump shows the tunnel, the password appears nowhere.
+    Json::Value dump;
+    int ret = ZEPA::Relay::Daemon::DebugStatus(dump);
+    for (int i = 0; ret == 11 && i < 20; ++i) ret = ZEPA::Relay::Daemon::DebugStatus(dump);
+    ASSERT_EQ(0, ret);
+    EXPECT_EQ("READY", dump["connection"]["tunnel"]["status"].asString()) << zepatest::ToJson(dump);
+    EXPECT_EQ("10.214.0.1", dump["connection"]["tunnel"]["peer_ip"].asString());
+    EXPECT_EQ(1, dump["connection"]["heartbeat_s"].asInt());
+    for (const std::string& text : {zepatest::ToJson(dump), root.read("/tmp/.zeparelayd.status"), Log()}) {
+        EXPECT_EQ(std::string::npos, text.find("relay_pass")) << text;
+    }
+
+    std::string out;
+    ASSERT_EQ(0, Ctl({"disable"}, &out)) << out;
+    ASSERT_TRUE(StatusHas("state: logout")) << CtlStatus();
+    EXPECT_FALSE(StatusFile().isMember("tunnel"));
+    EXPECT_TRUE(WaitUntil([&] { return VpnClients() == 0; }, 5000));
+    // The alias was deleted: the relay no longer knows where it leads.
+    ASSERT_TRUE(WaitUntil(
+        [&] {
+            for (const Json::Value& r : relay.server().requests("/alias_update.php")) {
+                if (zepatest::RecordedBody(r).find("action=delete_alias") != std::string::npos) return true;
+            }
+            return false;
+        },
+        10000));
+    EXPECT_EQ(0u, Page().find("404 ")) << Page();
+}
+
+}  // namespace
+
+namespace {
+
+TEST_F(RelayDaemonTest, RefusedTunnelIsAnErrorAndIsRetriedAfterABackOff) {
+    Json::Value on;
+    on["on"] = true;
+    ASSERT_TRUE(relay.Admin("POST", "/relay/admin/refuse", on)["ok"].asBool());
+    ASSERT_EQ(0, StartDaemon());
+    ASSERT_TRUE(WaitUntil([&] { return StatusFile()["tunnel"]["status"].asString() == "FAILED"; }, 20000))
+        << CtlStatus() << Log();
+    EXPECT_EQ(3, State());
+    EXPECT_EQ(6, StatusFile()["error"].asInt()) << "err_network";
+    EXPECT_EQ(0, VpnClients());
+    EXPECT_FALSE(root.exists("/tmp/.zepa_farlink_tunnel_info"));
+    EXPECT_NE(std::string::npos, Log().find("tunnel retry 1 in ")) << Log();
+
+    on["on"] = false;
+    ASSERT_TRUE(relay.Admin("POST", "/relay/admin/refuse", on)["ok"].asBool());
+    ASSERT_TRUE(WaitUntil([&] { return State() == 6; }, 30000)) << CtlStatus() << Log();
+    EXPECT_EQ(0, StatusFile()["error"].asInt());
+    EXPECT_EQ(0u, Page().find("200 "));
+}
+
+}  // namespace
