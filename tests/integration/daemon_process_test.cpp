@@ -3,6 +3,7 @@
 #include <curl/curl.h>
 #include <fcntl.h>
 #include <signal.h>
+#include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -231,6 +232,26 @@ TEST_F(DaemonProcess, DebugDumpAnswersWhileARequestHangs) {
     const std::string dumped = zepatest::ToJson(Dump());
     EXPECT_EQ(std::string::npos, dumped.find(token));
     EXPECT_NE(std::string::npos, dumped.find("***"));
+}
+
+TEST_F(DaemonProcess, DebugDumpNeverWritesThroughALinkAtItsTemporaryName) {
+    ASSERT_EQ(0, StartDaemon());
+    ASSERT_TRUE(StatusHas("state: connected"));
+    const pid_t pid = DaemonPid();
+    // Another user plants a link where the daemon's dump handler creates its
+    // temporary file, aiming at a file of its victim.
+    root.write("/etc/victim", "keep");
+    chmod(root.path("/etc/victim").c_str(), 0600);
+    const std::string dumpTmp =
+        root.path("/tmp/.zeparelayd." + std::to_string(pid) + ".debug.tmp." + std::to_string(pid));
+    ASSERT_EQ(0, symlink(root.path("/etc/victim").c_str(), dumpTmp.c_str()));
+    Daemon::LibInit();
+    const Json::Value dump = Dump();
+    EXPECT_EQ(pid, dump["pid"].asInt());
+    EXPECT_EQ("keep", root.read("/etc/victim"));
+    EXPECT_EQ(0600u, zepatest::FileMode(root.path("/etc/victim")) & 0777);
+    struct stat st;
+    EXPECT_NE(0, lstat(dumpTmp.c_str(), &st)) << "the planted link is gone, nothing is left at the name";
 }
 
 TEST_F(DaemonProcess, ReloadAppliesANewLogLevel) {

@@ -20,12 +20,23 @@ char gTmp[1100];
 // the loop frees a text only after it has been swapped out.
 std::atomic<const std::string*> gText{nullptr};
 
-// Async-signal-safe only: open, write, fchmod, close, rename.
+// The temporary name is predictable and /tmp is everyone's: create it
+// exclusively and never through a link. Whatever stands there (a link planted
+// by another user, our own leftover) is removed once; if something is back at
+// once, no dump this time rather than a write through it.
+int CreateDumpTemporary() {
+    const int flags = O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC;
+    int fd = open(gTmp, flags, 0644);
+    if (fd < 0 && errno == EEXIST && unlink(gTmp) == 0) fd = open(gTmp, flags, 0644);
+    return fd;
+}
+
+// Async-signal-safe only: open, unlink, write, fchmod, close, rename.
 void OnDumpSignal(int) {
     const int savedErrno = errno;
     const std::string* text = gText.load();
     if (text != nullptr) {
-        const int fd = open(gTmp, O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644);
+        const int fd = CreateDumpTemporary();
         if (fd >= 0) {
             const char* p = text->data();
             size_t left = text->size();
