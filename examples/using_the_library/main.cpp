@@ -19,7 +19,7 @@ int main(int argc, char** argv) {
     if (ZEPASysRootPath("/usr/zepa/etc/zeparelayd/zeparelayd.conf", confPath, sizeof(confPath)) < 0) return 2;
 
     RelaydConf conf(confPath);  // defaults when unreadable (logged)
-    std::cout << conf;  // full form, one JSON line
+    std::cout << conf;          // full form, one JSON line
 
     Request req(conf.serverControl.GetUrl(nullptr), Json::Value(Json::objectValue), true);
     Json::Value answer;
