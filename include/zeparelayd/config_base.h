@@ -6,12 +6,19 @@
 
 #include <json/value.h>
 
+#include <cstddef>
 #include <ostream>
 
 #include <zeparelayd/export.h>
 
 namespace ZEPA {
 namespace Relay {
+
+// Limits of every JSON file the library reads (configuration, status, alias
+// status, permission and debug files): a larger or deeper file is refused
+// like a broken one, before it can cost memory or stack.
+constexpr size_t JSON_FILE_MAX_BYTES = 1024 * 1024;
+constexpr int JSON_FILE_MAX_DEPTH = 64;
 
 // A configuration section: filled from JSON, checked, written back.
 // Write(out, false) is the persistent form stored in the file; Write(out, true)

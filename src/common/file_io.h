@@ -8,6 +8,8 @@
 #include <json/value.h>
 #include <sys/types.h>
 
+#include <zeparelayd/config_base.h>
+
 #include <cstddef>
 #include <string>
 
@@ -17,11 +19,11 @@ namespace FileIo {
 
 // The largest file the library reads: configuration, permission, region,
 // status, alias status and debug dump files are a few kilobytes at most.
-constexpr size_t MAX_FILE_BYTES = 1024 * 1024;
+constexpr size_t MAX_FILE_BYTES = JSON_FILE_MAX_BYTES;
 // The largest HTTP answer kept in memory; a longer one fails the transfer.
 constexpr size_t MAX_ANSWER_BYTES = 1024 * 1024;
 // Deepest JSON nesting accepted; our own documents stay below 8.
-constexpr int MAX_JSON_DEPTH = 64;
+constexpr int MAX_JSON_DEPTH = JSON_FILE_MAX_DEPTH;
 // How much of a body a log line shows.
 constexpr size_t MAX_LOGGED_BODY = 512;
 // A temporary file whose writer still lives is left alone up to this age.

@@ -75,6 +75,18 @@ std::string ListDir(const std::string& dir);
 // Runs a program, waits for it and gives its exit status (-1 when it did not
 // exit normally); its standard output goes to out when given.
 int RunProgram(const std::vector<std::string>& args, std::string* out = nullptr, std::string* err = nullptr);
+// How a program run under RunBounded ended.
+struct BoundedRun {
+    int status = -1;        // exit status, -1 when it did not exit normally
+    int signal = 0;         // the signal that ended it, 0 when none did
+    bool timedOut = false;  // still running at the time limit (then killed)
+    long maxRssKb = 0;      // its peak resident memory
+};
+// RunProgram for programs that may hang or die: killed after timeoutMs.
+BoundedRun RunBounded(const std::vector<std::string>& args, int timeoutMs, std::string* out = nullptr,
+                      std::string* err = nullptr);
+// Peak resident memory (VmHWM) of a live process in KiB, -1 when unreadable.
+long PeakMemoryKb(pid_t pid);
 void MakeDirs(const std::string& path);
 mode_t FileMode(const std::string& path);
 // Names in path's folder that start with path's name + ".tmp.": temporary

@@ -7,6 +7,7 @@
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
+#include <memory>
 
 #include <json/reader.h>
 #include <json/value.h>
@@ -17,14 +18,16 @@ namespace zepatools {
 
 namespace {
 
-const off_t kMaxSize = 1 << 20;
+const off_t kMaxSize = static_cast<off_t>(ZEPA::Relay::JSON_FILE_MAX_BYTES);
 
 class Checker {
 public:
     Checker(const std::string& path, ConfigCheck& out) : _path(path), _out(out) {}
 
     bool Read() {
-        const int fd = open(_path.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK);
+        // A link is followed as the library's reader does (the configuration's
+        // folder is root's); what it leads to must still be a regular file.
+        const int fd = open(_path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK);
         if (fd < 0) return Fail(std::string("cannot open: ") + strerror(errno));
         struct stat st;
         if (fstat(fd, &st) != 0 || !S_ISREG(st.st_mode)) {
@@ -47,13 +50,37 @@ public:
     }
 
     bool Parse() {
-        Json::Reader reader;
-        if (reader.parse(_text, _root, false)) return true;
-        for (const Json::Reader::StructuredError& e : reader.getStructuredErrors()) {
-            At(static_cast<size_t>(e.offset_start), e.message);
+        // The library reads with a nesting limit; a file it would refuse must
+        // not pass here. The older reader below gives line and column of a
+        // syntax error but throws past its own, deeper limit.
+        if (!WithinDepth()) {
+            return Fail("nested deeper than " + std::to_string(ZEPA::Relay::JSON_FILE_MAX_DEPTH) + " levels");
+        }
+        try {
+            Json::Reader reader;
+            if (reader.parse(_text, _root, false)) return true;
+            for (const Json::Reader::StructuredError& e : reader.getStructuredErrors()) {
+                At(static_cast<size_t>(e.offset_start), e.message);
+            }
+        } catch (const std::exception& e) {
+            _root = Json::Value();
+            return Fail(std::string("not valid JSON (") + e.what() + ")");
         }
         if (_out.errors.empty()) Fail("not valid JSON");
         return false;
+    }
+
+    bool WithinDepth() const {
+        try {
+            Json::CharReaderBuilder builder;
+            builder["stackLimit"] = ZEPA::Relay::JSON_FILE_MAX_DEPTH;
+            std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
+            Json::Value ignored;
+            reader->parse(_text.data(), _text.data() + _text.size(), &ignored, nullptr);
+            return true;
+        } catch (const std::exception&) {
+            return false;
+        }
     }
 
     void CheckShape() {

@@ -23,12 +23,14 @@ Control API (never recorded):
   POST /_control/script                -> queue scripted answers for a path, body:
          {"path": "/x", "count": 1, "status": 503, "body": "text",
           "body_base64": "...", "json": {...}, "headers": {"K": "V"},
-          "action": "reply" | "hang" | "close" | "reset",
-          "seconds": 0.5}
+          "action": "reply" | "hang" | "close" | "reset" | "stream",
+          "seconds": 0.5, "size": 1073741824}
        "hang" waits `seconds` (default 30, cut short by shutdown), then closes
        without an answer; "close" closes at once without an answer; "reset"
        closes with a TCP reset; "reply" (the default) answers after `seconds`
-       (default 0).
+       (default 0); "stream" answers `size` bytes: the body given, repeated,
+       written piece by piece so that a gigabyte costs the server nothing
+       (it stops when the client hangs up).
   GET  /_control/requests[?path=/x]    -> {"requests": [record, ...]} in arrival order
   POST /_control/reset                 -> forgets records and scripts, runs reset hooks
 
@@ -128,8 +130,10 @@ class Reply:
     For "reply", `seconds` delays the answer.
     """
 
-    def __init__(self, status=200, body=b"", headers=None, action="reply", seconds=0.0, content_type=None):
+    def __init__(self, status=200, body=b"", headers=None, action="reply", seconds=0.0, content_type=None,
+                 size=0):
         self.status = status
+        self.size = size
         if isinstance(body, (dict, list)):
             body = json.dumps(body).encode("utf-8")
             content_type = content_type or "application/json"
@@ -161,7 +165,8 @@ def _script_reply(plan):
         body = plan["body"].encode("utf-8")
     action = plan.get("action", "reply")
     seconds = float(plan.get("seconds", 30.0 if action == "hang" else 0.0))
-    return Reply(int(plan.get("status", 200)), body, plan.get("headers") or {}, action, seconds)
+    return Reply(int(plan.get("status", 200)), body, plan.get("headers") or {}, action, seconds,
+                 size=int(plan.get("size", 0)))
 
 
 class LocalServer:
@@ -319,6 +324,9 @@ class Handler(BaseHTTPRequestHandler):
         if reply.seconds > 0 and app.wait(reply.seconds):
             self.close_connection = True
             return
+        if reply.action == "stream":
+            self._stream(reply)
+            return
         self.send_response(reply.status)
         names = set()
         for k, v in reply.headers:
@@ -332,6 +340,23 @@ class Handler(BaseHTTPRequestHandler):
                 self.wfile.write(reply.body)
             except (BrokenPipeError, ConnectionResetError, ssl.SSLError):
                 self.close_connection = True
+
+    def _stream(self, reply):
+        self.close_connection = True
+        self.send_response(reply.status)
+        for k, v in reply.headers:
+            self.send_header(k, v)
+        self.send_header("Content-Length", str(reply.size))
+        self.end_headers()
+        piece = (reply.body or b"x") * max(1, 65536 // max(1, len(reply.body or b"x")))
+        left = reply.size
+        try:
+            while left > 0 and not self.server.app.stopping.is_set():
+                chunk = piece[:left]
+                self.wfile.write(chunk)
+                left -= len(chunk)
+        except (BrokenPipeError, ConnectionResetError, ssl.SSLError, OSError):
+            pass
 
     do_GET = _handle
     do_POST = _handle
