@@ -3,6 +3,8 @@
 #include <json/reader.h>
 #include <json/writer.h>
 
+#include <algorithm>
+#include <climits>
 #include <cstdint>
 #include <cstdio>
 #include <cstdlib>
@@ -74,8 +76,10 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     if (value.isObject() && value.isMember("server_alias")) {
         AliasConf alias;
         alias.Overwrite(value["server_alias"]);
-        int t = alias.GetPollingTime();
-        Check(t >= alias.GetPollSeconds() && t < 2 * alias.GetPollSeconds(), "polling time in range");
+        const long long t = alias.GetPollingTime();
+        const long long poll = alias.GetPollSeconds();
+        // [poll, 2 * poll - 1], cut at the largest int.
+        Check(t >= poll && t <= std::min<long long>(2 * poll - 1, INT_MAX), "polling time in range");
     }
     return 0;
 }

@@ -1,5 +1,6 @@
 #define ZEPA_LOG_SOURCE "config_alias"
 
+#include <limits.h>
 #include <stdlib.h>
 #include <time.h>
 
@@ -93,8 +94,11 @@ int AliasConf::GetPollSeconds() const { return _pollSeconds; }
 
 int AliasConf::GetPollingTime() const {
     // Overwrite never stores a period below 1; guard anyway, a zero divisor must not happen.
-    int poll = _pollSeconds > 0 ? _pollSeconds : DEFAULT_POLL_SECONDS;
-    return poll + static_cast<int>(random() % poll);
+    const long long poll = _pollSeconds > 0 ? _pollSeconds : DEFAULT_POLL_SECONDS;
+    // A period above INT_MAX / 2 (68 years) would overflow the sum: the
+    // delay stops at the largest int instead.
+    const long long delay = poll + random() % poll;
+    return delay > INT_MAX ? INT_MAX : static_cast<int>(delay);
 }
 
 }  // namespace Relay

@@ -172,6 +172,19 @@ TEST_F(AliasConfTest, PollingTimeWithDefaultPeriodStaysInRange) {
     EXPECT_GT(seen.size(), 1u);
 }
 
+// Periods past half the int range: the delay is never below the period
+// and never wraps into a negative number.
+TEST_F(AliasConfTest, PollingTimeOfAHugePeriodStaysAtLeastThePeriod) {
+    for (const char* period : {"1799981407", "2147483647", "1073741824"}) {
+        SCOPED_TRACE(period);
+        AliasConf conf;
+        ASSERT_TRUE(conf.Overwrite(ParseJson(std::string("{\"poll_seconds\":") + period + "}")));
+        const int poll = conf.GetPollSeconds();
+        ASSERT_EQ(std::stoll(period), poll);
+        for (int i = 0; i < 2000; ++i) ASSERT_GE(conf.GetPollingTime(), poll);
+    }
+}
+
 TEST_F(AliasConfTest, ValidSectionLogsNothing) {
     AliasConf conf;
     zepatest::StderrCapture cap;
