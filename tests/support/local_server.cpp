@@ -88,6 +88,10 @@ void LocalServer::Start(const Options& options) {
         args.push_back(options.routesDir);
     }
     args.insert(args.end(), options.extraArgs.begin(), options.extraArgs.end());
+    // A test that dies without its destructors (a time-out's SIGKILL) must
+    // not leave the server, or the relay's namespaces and openvpn, behind.
+    args.push_back("--owner-pid");
+    args.push_back(std::to_string(getpid()));
     std::vector<char*> argv;
     for (std::string& a : args) argv.push_back(&a[0]);
     argv.push_back(nullptr);

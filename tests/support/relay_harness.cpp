@@ -7,10 +7,13 @@
 #include <unistd.h>
 
 #include <atomic>
+#include <cerrno>
+#include <csignal>
 #include <cstdlib>
 #include <cstring>
 #include <fstream>
 #include <sstream>
+#include <vector>
 
 namespace zepatest {
 
@@ -30,6 +33,62 @@ size_t Collect(char* data, size_t size, size_t count, void* out) {
 }
 
 bool RunQuiet(const std::string& command) { return system((command + " >/dev/null 2>&1").c_str()) == 0; }
+
+std::string ReadWhole(const std::string& path) {
+    std::ifstream in(path, std::ios::binary);
+    std::stringstream ss;
+    ss << in.rdbuf();
+    return ss.str();
+}
+
+// The test process that made a namespace "zepa-t<pid>-<n>-<side>", when it is
+// gone; 0 for a namespace of a live test or of another owner.
+pid_t DeadOwner(const std::string& ns) {
+    if (ns.compare(0, 6, "zepa-t") != 0) return 0;
+    const pid_t pid = static_cast<pid_t>(atoi(ns.c_str() + 6));
+    return pid > 0 && kill(pid, 0) != 0 && errno == ESRCH ? pid : 0;
+}
+
+std::vector<pid_t> Processes() {
+    std::vector<pid_t> pids;
+    DIR* proc = opendir("/proc");
+    if (proc == nullptr) return pids;
+    while (struct dirent* entry = readdir(proc)) {
+        const std::string name = entry->d_name;
+        if (!name.empty() && name.find_first_not_of("0123456789") == std::string::npos)
+            pids.push_back(atoi(name.c_str()));
+    }
+    closedir(proc);
+    return pids;
+}
+
+// What a test killed midway (no destructors ran) left: its daemon, which
+// runs in the host's namespace, and its relay's namespaces with whatever
+// still runs inside. The local server stops on its own with its owner.
+void SweepDeadTests() {
+    for (pid_t pid : Processes()) {
+        if (ReadWhole("/proc/" + std::to_string(pid) + "/comm") != "zeparelayd\n") continue;
+        const std::string cmdline = ReadWhole("/proc/" + std::to_string(pid) + "/cmdline");
+        const std::string flag = std::string("--root") + '\0';
+        const size_t at = cmdline.find(flag);
+        if (at == std::string::npos) continue;
+        const std::string root = cmdline.c_str() + at + flag.size();
+        std::string ns = ReadWhole(root + "/etc/zepa/appliance_netns");
+        ns = ns.substr(0, ns.find('\n'));
+        if (!ns.empty() && DeadOwner(ns) > 0) kill(pid, SIGKILL);
+    }
+    DIR* dir = opendir("/run/netns");
+    if (dir == nullptr) return;
+    std::vector<std::string> stale;
+    while (struct dirent* entry = readdir(dir)) {
+        if (DeadOwner(entry->d_name) > 0) stale.push_back(entry->d_name);
+    }
+    closedir(dir);
+    for (const std::string& ns : stale) {
+        RunQuiet("ip netns pids " + ns + " | xargs -r kill -9");
+        RunQuiet("ip netns del " + ns);
+    }
+}
 
 }  // namespace
 
@@ -71,6 +130,7 @@ RelayHarness::~RelayHarness() {
 }
 
 bool RelayHarness::Start(const TempRoot& root) {
+    SweepDeadTests();
     name = "t" + std::to_string(getpid()) + "-" + std::to_string(g_counter++);
     relayNetns = "zepa-" + name + "-r";
     applianceNetns = "zepa-" + name + "-a";

@@ -266,6 +266,10 @@ class RelayWorld:
         self.stop_servers(extra=[self.web])
         self.web = None
         if self.created:
+            # What still runs inside (the appliance's own openvpn, say, when
+            # its daemon was left behind) would keep a namespace alive.
+            for ns in self.created:
+                _kill_inside(ns)
             subprocess.run(["ip", "-force", "-batch", "-"], input="".join("netns del %s\n" % ns for ns in self.created),
                            stdout=subprocess.DEVNULL, stderr=subprocess.DEVNULL, text=True)
         self.created = []
@@ -323,6 +327,18 @@ class RelayWorld:
         return {"ip": RELAY_IP, "port": VPN_PORT, "relay_netns": self.relay_ns,
                 "appliance_netns": self.appliance_ns, "ca_file": self.ca_file, "web_port": WEB_PORT,
                 "appliance_ip": APPLIANCE_WAN_IP, "work_dir": self.work}
+
+
+def _kill_inside(ns):
+    try:
+        out = subprocess.run(["ip", "netns", "pids", ns], capture_output=True, text=True, timeout=5).stdout
+    except (OSError, subprocess.SubprocessError):
+        return
+    for word in out.split():
+        try:
+            os.kill(int(word), signal.SIGKILL)
+        except (ValueError, OSError):
+            pass
 
 
 def _stop_all(procs):

@@ -447,6 +447,18 @@ def load_routes(app, routes_dir):
             app.route(route_path, handler)
 
 
+def _watch_owner(pid, stop):
+    """Sets stop once process pid is gone (or a zombie)."""
+    while not stop.wait(0.2):
+        try:
+            with open("/proc/%d/stat" % pid) as f:
+                state = f.read().rsplit(")", 1)[1].split()[0]
+        except (OSError, IndexError):
+            state = "gone"
+        if state in ("Z", "X", "gone"):
+            stop.set()
+
+
 def write_ready(path, info):
     tmp = "%s.tmp.%d" % (path, os.getpid())
     with open(tmp, "w") as f:
@@ -467,6 +479,8 @@ def main(argv=None):
                         "namespaces zepa-NAME-r and zepa-NAME-a, openvpn servers, the appliance's web service")
     parser.add_argument("--relay-dir", help="work folder of the relay's VPN side (default: a temporary "
                         "folder removed at exit)")
+    parser.add_argument("--owner-pid", type=int, default=0, help="stop (as on SIGTERM) once this process is "
+                        "gone, so that a test killed midway leaves no server, openvpn or namespace behind")
     args = parser.parse_args(argv)
 
     # A stop request may come at any moment, even while the certificates are
@@ -478,6 +492,8 @@ def main(argv=None):
 
     signal.signal(signal.SIGTERM, on_signal)
     signal.signal(signal.SIGINT, on_signal)
+    if args.owner_pid > 0:
+        threading.Thread(target=_watch_owner, args=(args.owner_pid, stop), daemon=True).start()
 
     app = LocalServer()
     app.verbose = args.verbose
