@@ -82,7 +82,9 @@ struct BoundedRun {
     bool timedOut = false;  // still running at the time limit (then killed)
     long maxRssKb = 0;      // its peak resident memory
 };
-// RunProgram for programs that may hang or die: killed after timeoutMs.
+// RunProgram for programs that may hang or die: killed after timeoutMs
+// (waited for without limit when negative). Standard error is captured only
+// when err is given.
 BoundedRun RunBounded(const std::vector<std::string>& args, int timeoutMs, std::string* out = nullptr,
                       std::string* err = nullptr);
 // Peak resident memory (VmHWM) of a live process in KiB, -1 when unreadable.
