@@ -78,8 +78,10 @@ public:
             Json::Value ignored;
             reader->parse(_text.data(), _text.data() + _text.size(), &ignored, nullptr);
             return true;
+        } catch (const Json::Exception&) {
+            return false;  // past the limit
         } catch (const std::exception&) {
-            return false;
+            return true;  // no memory: the parse below fails and says so
         }
     }
 
