@@ -20,7 +20,6 @@ build=${ZEPA_DEMO_BUILD:-$src/build-demo}
 stage=${ZEPA_DEMO_STAGE:-$build/demo-root}
 bin_d=$build/tools/zeparelayd/zeparelayd
 bin_c=$build/tools/zeparelayctl/zeparelayctl
-server_pid=""
 
 # Colour only for a terminal.
 if [ -t 1 ]; then bold=$'\033[1m' plain=$'\033[0m'; else bold="" plain=""; fi
@@ -36,42 +35,62 @@ py() {
 $code" "$@"
 }
 
-# Stops what the demo started: the daemon (only when its PID file names a
-# zeparelayd), the local server and any child still running.
+# Stops what the demo started: the steps, the daemon (only when its PID file
+# names a zeparelayd) and the local server (only when the pid the steps noted
+# is it). It runs in the supervising shell below, never in the steps' shell.
 cleanup() {
   local rc=$?
   trap - EXIT INT TERM
   trap '' INT TERM
-  # The shell may leave through "set -e" (a child killed by the signal) before
-  # its INT trap runs: the status tells either way.
   if [ "$rc" -eq 130 ] || [ "$rc" -eq 143 ]; then
     echo
     echo "interrupted"
     rc=130
   fi
-  if [ -f "$stage/var/run/zeparelayd.pid" ]; then
-    local pid
-    pid=$(cat "$stage/var/run/zeparelayd.pid" 2>/dev/null || true)
-    if [ -n "$pid" ] && [ "$(cat "/proc/$pid/comm" 2>/dev/null)" = zeparelayd ]; then
-      kill -TERM "$pid" 2>/dev/null || true
-      for _ in $(seq 50); do kill -0 "$pid" 2>/dev/null || break; sleep 0.1; done
-      kill -KILL "$pid" 2>/dev/null || true
-    fi
+  local pid children
+  if [ -n "$steps_pid" ]; then
+    # The steps and what they run right now (a background shell's children
+    # ignore Ctrl-C).
+    children=$(cat /proc/"$steps_pid"/task/*/children 2>/dev/null || true)
+    kill -TERM "$steps_pid" $children 2>/dev/null || true
+    wait "$steps_pid" 2>/dev/null || true
   fi
-  if [ -n "$server_pid" ] && kill -0 "$server_pid" 2>/dev/null; then
-    kill -TERM "$server_pid" 2>/dev/null || true
-    wait "$server_pid" 2>/dev/null || true
+  pid=$(cat "$stage/var/run/zeparelayd.pid" 2>/dev/null || true)
+  if [ -n "$pid" ] && [ "$(cat "/proc/$pid/comm" 2>/dev/null)" = zeparelayd ]; then
+    kill -TERM "$pid" 2>/dev/null || true
+    for _ in $(seq 50); do kill -0 "$pid" 2>/dev/null || break; sleep 0.1; done
+    kill -KILL "$pid" 2>/dev/null || true
   fi
-  local child
-  for child in $(cat /proc/$$/task/*/children 2>/dev/null); do
-    kill -TERM "$child" 2>/dev/null || true
-  done
-  wait 2>/dev/null || true
+  pid=$(cat "$stage/tmp/server.pid" 2>/dev/null || true)
+  if [ -n "$pid" ] && grep -qa zepa_localserver.py "/proc/$pid/cmdline" 2>/dev/null; then
+    # It stops its openvpn servers and namespaces itself.
+    kill -TERM "$pid" 2>/dev/null || true
+    for _ in $(seq 100); do kill -0 "$pid" 2>/dev/null || break; sleep 0.1; done
+  fi
   exit "$rc"
 }
-interrupted() { exit 130; }
-trap cleanup EXIT
-trap interrupted INT TERM
+
+# Ctrl-C: bash may run a trap while it is parsing a command substitution and
+# then fail to parse the trap itself ("unexpected EOF while looking for
+# matching `)'"), leaving the demo half stopped; and a shell without a trap
+# may take a Ctrl-C that lands as a short command ends for that command's
+# own and go on. So the steps run in a child shell, and this shell only
+# waits for it, where its trap runs at once and cleanly, ends it and cleans up.
+if [ -z "${ZEPA_DEMO_STEPS:-}" ]; then
+  steps_pid=""
+  interrupted() { exit 130; }
+  trap cleanup EXIT
+  trap interrupted INT TERM
+  rm -f "$stage/tmp/server.pid"
+  ZEPA_DEMO_STEPS=1 bash "$0" "$@" &
+  steps_pid=$!
+  set +e
+  wait "$steps_pid"
+  rc=$?
+  set -e
+  steps_pid=""
+  exit "$rc"
+fi
 
 # Polls a command until its output contains a text (bounded wait).
 wait_for() { # seconds text command...
@@ -155,7 +174,7 @@ fi
 step "4. Local relay control and alias server (HTTPS on loopback, throwaway CA)"
 python3 "$src/tools/localserver/zepa_localserver.py" --ready-file "$stage/tmp/server.json" \
   --cert-dir "$stage/certs" "${relay_args[@]}" &
-server_pid=$!
+echo "$!" >"$stage/tmp/server.pid"
 for _ in $(seq 100); do [ -f "$stage/tmp/server.json" ] && break; sleep 0.1; done
 [ -f "$stage/tmp/server.json" ] || { echo "demo: the local server did not start" >&2; exit 1; }
 read -r http_port https_port ca_file < <(py \
