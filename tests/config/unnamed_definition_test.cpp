@@ -31,7 +31,9 @@ protected:
 };
 
 TEST_F(UnnamedDefinitionTest, DefinitionWithoutNameAborts) {
-    GTEST_FLAG_SET(death_test_style, "threadsafe");
+    // "fast": the dying child is forked here and shares this test's root,
+    // which TearDown removes; a re-run child would leave a root of its own.
+    GTEST_FLAG_SET(death_test_style, "fast");
     zepatest::WriteStockFwDefinitions(root);
     EXPECT_DEATH(ZEPA::Relay::ServiceConf("nos"), "Assertion .'.0' != \\*\\(pService->szName\\)' failed");
 }
