@@ -55,6 +55,8 @@ public:
     bool SetStatus(const std::string& aliasName, const std::string& status, const std::string& extra,
                    bool dump);
     bool GetStatus(const std::string& aliasName, std::string& status, std::string& extra) const;
+    // The status file, resolved against the system root.
+    static std::string GetPath();
 
 private:
     Json::Value _doc;

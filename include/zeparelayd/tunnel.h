@@ -60,6 +60,16 @@ public:
     // "peer_ip" of the tunnel info file written by the up script; empty when missing.
     static std::string GetVpnTunnelPeerIp();
 
+    // Where the tunnel's parts live, resolved against the system root: the VPN
+    // program, the relay's CA, the up and down scripts, the module tool and
+    // the kernel's tun device. For checks that look before anything runs.
+    static std::string GetProgramPath();
+    static std::string GetCaCertPath();
+    static std::string GetUpScriptPath();
+    static std::string GetDownScriptPath();
+    static std::string GetModuleToolPath();
+    static std::string GetTunDevicePath();
+
     int pid;  // -1: no child
     std::string relay_ip;
     std::string relay_user;

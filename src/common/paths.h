@@ -48,6 +48,8 @@ constexpr const char TUNNEL_UP_SCRIPT[] = "/usr/zepa/etc.defaults/zeparelayd/scr
 constexpr const char TUNNEL_DOWN_SCRIPT[] = "/usr/zepa/etc.defaults/zeparelayd/scripts/down.sh";
 constexpr const char OPENVPN[] = "/usr/sbin/openvpn";
 constexpr const char IPTABLESTOOL[] = "/usr/zepa/bin/iptablestool";
+// The kernel's tun device that openvpn opens.
+constexpr const char TUN_DEVICE[] = "/dev/net/tun";
 
 // Process information of the running system; never resolved against the root,
 // since the processes a root's files name are real.

@@ -24,6 +24,8 @@ AliasStatus::AliasStatus() { Reload(); }
 
 AliasStatus::~AliasStatus() = default;
 
+std::string AliasStatus::GetPath() { return StatusFile(); }
+
 bool AliasStatus::Reload() { return RelaydConf::ReadJsonFile(StatusFile(), _doc); }
 
 bool AliasStatus::IsValid() const {

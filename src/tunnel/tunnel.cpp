@@ -166,5 +166,12 @@ std::string Tunnel::GetVpnTunnelPeerIp() {
     return buf;
 }
 
+std::string Tunnel::GetProgramPath() { return Paths::Resolve(Paths::OPENVPN); }
+std::string Tunnel::GetCaCertPath() { return Paths::Resolve(Paths::TUNNEL_CA_CERT); }
+std::string Tunnel::GetUpScriptPath() { return Paths::Resolve(Paths::TUNNEL_UP_SCRIPT); }
+std::string Tunnel::GetDownScriptPath() { return Paths::Resolve(Paths::TUNNEL_DOWN_SCRIPT); }
+std::string Tunnel::GetModuleToolPath() { return Paths::Resolve(Paths::IPTABLESTOOL); }
+std::string Tunnel::GetTunDevicePath() { return Paths::Resolve(Paths::TUN_DEVICE); }
+
 }  // namespace Relay
 }  // namespace ZEPA

@@ -179,3 +179,10 @@ TEST_F(AliasStatusTest, DumpFailsWhenFolderMissing) {
     EXPECT_TRUE(LogContains(cap.stop(), "open failed"));
     EXPECT_FALSE(root.exists(STATUS));
 }
+
+TEST_F(AliasStatusTest, PathIsTheStatusFileBelowTheRoot) {
+    EXPECT_EQ(root.path(STATUS), AliasStatus::GetPath());
+    AliasStatus st;
+    ASSERT_TRUE(st.SetStatus("box", "good", "", true));
+    EXPECT_TRUE(zepatest::FileExists(AliasStatus::GetPath()));
+}

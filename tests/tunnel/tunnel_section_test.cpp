@@ -203,3 +203,18 @@ TEST(TunnelWrite, WrittenFormReadsBackWithoutTheSecret) {
 }
 
 }  // namespace
+
+namespace {
+
+// Paths below a staging root: each getter names its file under that root.
+TEST(TunnelPaths, ResolvedBelowTheRoot) {
+    zepatest::TempRoot root;
+    EXPECT_EQ(root.path("/usr/sbin/openvpn"), Tunnel::GetProgramPath());
+    EXPECT_EQ(root.path("/usr/zepa/etc/zeparelayd/ca/ca.crt"), Tunnel::GetCaCertPath());
+    EXPECT_EQ(root.path("/usr/zepa/etc.defaults/zeparelayd/scripts/up.sh"), Tunnel::GetUpScriptPath());
+    EXPECT_EQ(root.path("/usr/zepa/etc.defaults/zeparelayd/scripts/down.sh"), Tunnel::GetDownScriptPath());
+    EXPECT_EQ(root.path("/usr/zepa/bin/iptablestool"), Tunnel::GetModuleToolPath());
+    EXPECT_EQ(root.path("/dev/net/tun"), Tunnel::GetTunDevicePath());
+}
+
+}  // namespace
