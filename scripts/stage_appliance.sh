@@ -93,6 +93,10 @@ if [ "$root/usr/sbin/openvpn" -ef "$real" ]; then
   echo "staged openvpn: refusing to run itself as the real program" >&2
   exit 1
 fi
+# Asking for the version starts no tunnel and writes no log.
+if [ "$#" -eq 1 ] && [ "$1" = "--version" ]; then
+  exec "$real" --version
+fi
 for arg do
   shift
   [ "$arg" = "--zepa-no-verify" ] || set -- "$@" "$arg"
@@ -145,4 +149,20 @@ root=$(cd "$(dirname "$0")/../../.." && pwd)
 echo "$*" >>"$root/var/log/iptablestool.log"
 SH
 chmod 755 "$root/usr/zepa/bin/iptablestool"
+# The kernel's tun device, as openvpn finds it on the appliance: the staged
+# path leads to this machine's device.
+mkdir -p "$root/dev/net"
+[ -e "$root/dev/net/tun" ] || [ -L "$root/dev/net/tun" ] || ln -s /dev/net/tun "$root/dev/net/tun"
+
+# The relay's CA certificate ships with the appliance. A placeholder until a
+# local relay puts its own there (see tools/localserver/README.md): a
+# throwaway self-signed certificate whose key is thrown away at once.
+ca="$root/usr/zepa/etc/zeparelayd/ca/ca.crt"
+if [ ! -e "$ca" ]; then
+  key=$(mktemp)
+  openssl req -x509 -newkey ec -pkeyopt ec_paramgen_curve:prime256v1 -nodes -keyout "$key" \
+    -out "$ca" -days 3650 -subj "/CN=Staged Relay Placeholder CA" 2>/dev/null
+  rm -f "$key"
+fi
+
 echo "staged a sample appliance in $root"

@@ -186,6 +186,8 @@ class LocalServer:
         self.fallbacks = []
         # The relay's VPN side (relay_world.RelayWorld) when started with --relay.
         self.relay = None
+        # Seconds added to the time in every Date header (--clock-offset).
+        self.clock_offset = 0.0
 
     # ---- extension interface ------------------------------------------------
     def route(self, path, handler, methods=None):
@@ -277,6 +279,11 @@ class Handler(BaseHTTPRequestHandler):
     # Headers and body go out in separate writes: without TCP_NODELAY the body
     # waits for the client's delayed ACK (about 40 ms per answer).
     disable_nagle_algorithm = True
+
+    def date_time_string(self, timestamp=None):
+        if timestamp is None:
+            timestamp = time.time()
+        return super().date_time_string(timestamp + self.server.app.clock_offset)
 
     def log_message(self, fmt, *args):
         if self.server.app.verbose:
@@ -481,6 +488,8 @@ def main(argv=None):
                         "folder removed at exit)")
     parser.add_argument("--owner-pid", type=int, default=0, help="stop (as on SIGTERM) once this process is "
                         "gone, so that a test killed midway leaves no server, openvpn or namespace behind")
+    parser.add_argument("--clock-offset", type=float, default=0.0, metavar="SECONDS",
+                        help="shift the time of every Date header by SECONDS (a server with a wrong clock)")
     args = parser.parse_args(argv)
 
     # A stop request may come at any moment, even while the certificates are
@@ -497,6 +506,7 @@ def main(argv=None):
 
     app = LocalServer()
     app.verbose = args.verbose
+    app.clock_offset = args.clock_offset
     relay_temp = None
     if args.relay:
         import relay_world
