@@ -73,6 +73,7 @@ private:
     // ---- published files (status_writer.cpp) ---------------------------------
     void SetState(ZEPA::Relay::RELAYD_STATE state, ZEPA::Relay::RELAYD_RET error);
     void WriteStatus();
+    void AddTimes(Json::Value& status) const;
     void RenderDebugDump();
     Json::Value DebugDump() const;
 

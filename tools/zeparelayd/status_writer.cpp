@@ -32,6 +32,38 @@ void RelayDaemon::SetState(RELAYD_STATE state, RELAYD_RET error) {
     WriteStatus();
 }
 
+namespace {
+
+// Seconds since the epoch of a wait that runs out in ms; null when none runs.
+Json::Value DueAt(const Json::Value& remainingMs) {
+    if (!remainingMs.isIntegral() || remainingMs.asInt64() < 0) return Json::Value();
+    return static_cast<Json::Int64>(time(nullptr) + (remainingMs.asInt64() + 999) / 1000);
+}
+
+// The time of a result: kept from the last file while the result is the same.
+Json::Value Since(const Json::Value& last, const char* key, bool same) {
+    if (same && last.isObject() && last[key].isIntegral()) return last[key];
+    return static_cast<Json::Int64>(time(nullptr));
+}
+
+}  // namespace
+
+// When the registration and the alias results came (unix seconds) and when
+// the next attempt of each is due (null: none planned), for "doctor".
+void RelayDaemon::AddTimes(Json::Value& status) const {
+    const Json::Value& last = _lastStatus;
+    const bool sameRegistration =
+        last.isObject() && last["state"] == status["state"] && last["error"] == status["error"];
+    status["registration_at"] = Since(last, "registration_at", sameRegistration);
+    const bool sameAlias = last.isObject() && last["alias_status"] == status["alias_status"];
+    status["alias_at"] = Since(last, "alias_at", sameAlias);
+    Json::Value registration, alias;
+    _registration.Dump(registration);
+    _alias.Dump(alias);
+    status["registration_retry_at"] = DueAt(registration["retry_in_ms"]);
+    status["alias_retry_at"] = DueAt(alias["next_in_ms"]);
+}
+
 void RelayDaemon::WriteStatus() {
     Json::Value status(Json::objectValue);
     status["pid"] = static_cast<int>(getpid());
@@ -45,6 +77,7 @@ void RelayDaemon::WriteStatus() {
     const Json::Value connection = _tunnel.Status();
     status["connect"] = connection["connect"];
     if (connection.isMember("tunnel")) status["tunnel"] = connection["tunnel"];
+    AddTimes(status);
     if (status == _lastStatus) return;
     if (RelaydConf::WriteJsonFile(Daemon::GetStatusPath(), status)) _lastStatus = status;
     NotifyStatus(ServiceStatusLine(GetStateStr(_state), GetErrorStr(_error), _alias.Word()));
@@ -81,6 +114,8 @@ Json::Value RelayDaemon::DebugDump() const {
 }
 
 void RelayDaemon::RenderDebugDump() {
+    // A retry planned after the last write shows up in the status file too.
+    WriteStatus();
     Json::StreamWriterBuilder writer;
     writer["indentation"] = "   ";
     PublishDebugDump(Json::writeString(writer, DebugDump()) + "\n");
