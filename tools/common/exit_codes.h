@@ -6,9 +6,9 @@
 namespace zepatools {
 
 enum ExitCode {
-    EXIT_OK = 0,
-    EXIT_NOT_RUNNING = 1,      // the daemon does not run
-    EXIT_BROKEN_STATUS = 2,    // "status": the status file is broken
+    EXIT_OK = 0,               // "doctor": every check ok
+    EXIT_NOT_RUNNING = 1,      // the daemon does not run; "doctor": warnings only
+    EXIT_BROKEN_STATUS = 2,    // "status": the status file is broken; "doctor": a check failed
     EXIT_NO_LOOP = 3,          // zeparelayd: signals or event loop could not be set up
     EXIT_NO_PID_FILE = 4,      // zeparelayd: the daemon could not create its PID file
     EXIT_CONFIG = 5,           // the configuration is broken, or not readable or writable
@@ -22,9 +22,9 @@ enum ExitCode {
 // The table as both programs print it in their --help.
 inline const char kExitTable[] =
     "Exit status (zeparelayd and zeparelayctl):\n"
-    "    0  done; status: the daemon runs\n"
-    "    1  the daemon does not run\n"
-    "    2  status: the status file is broken\n"
+    "    0  done; status: the daemon runs; doctor: every check ok\n"
+    "    1  the daemon does not run; doctor: warnings, no failure\n"
+    "    2  status: the status file is broken; doctor: at least one check failed\n"
     "    3  zeparelayd: signals or event loop could not be set up\n"
     "    4  zeparelayd: the PID file could not be created\n"
     "    5  the configuration is broken, or cannot be read or written\n"

@@ -5,6 +5,8 @@
 #include <unistd.h>
 
 #include <cstdio>
+#include <cstdlib>
+#include <cstring>
 #include <iostream>
 
 #include <json/writer.h>
@@ -16,6 +18,7 @@
 
 #include "config_check.h"
 #include "daemon_process.h"
+#include "doctor.h"
 
 using namespace ZEPA::Relay;
 
@@ -333,6 +336,24 @@ int ConfigCmd(const Args& args, const Options&) {
     return RelaydConf::WriteJsonFile("-", full) ? EXIT_OK : EXIT_CONFIG;
 }
 
+int DoctorCmd(const Args& args, const Options& opt) {
+    if (!args.empty() || opt.debug) return EXIT_USAGE;
+    const DoctorReport report = RunDoctor(opt.timeoutMs > 0 ? opt.timeoutMs : DOCTOR_DEFAULT_TIMEOUT_MS);
+    if (opt.json) {
+        Json::StreamWriterBuilder writer;
+        writer["indentation"] = "";
+        printf("%s\n", Json::writeString(writer, report.ToJson()).c_str());
+    } else {
+        // Colour only for a person at a terminal.
+        const char* term = getenv("TERM");
+        const bool colour = isatty(STDOUT_FILENO) && getenv("NO_COLOR") == nullptr && term != nullptr &&
+                            strcmp(term, "dumb") != 0;
+        fputs(report.ToText(colour).c_str(), stdout);
+    }
+    fflush(stdout);
+    return report.ExitStatus();
+}
+
 }  // namespace
 
 const Command kCommands[] = {
@@ -381,6 +402,21 @@ const Command kCommands[] = {
     {"disable", "disable", "Switches the relay off, like enable otherwise.\n", Disable},
     {"services", "services", "Lists the relayed services of the configuration.\n", Services},
     {"config", "config", "Prints the whole configuration in its full form.\n", ConfigCmd},
+    {"doctor", "doctor [--json] [--timeout SECONDS]",
+     "Checks, in order, everything the relay needs and says for each check ok, warn,\n"
+     "fail or skipped, with its time and, when something is wrong, what to do: the\n"
+     "configuration and relay switch, the identity, the daemon, the control and\n"
+     "alias servers (name lookup, TCP, TLS, HTTP, the alias's mapping), the clock,\n"
+     "the tunnel's prerequisites and the relayed services. Changes nothing: no\n"
+     "registration, no alias change, no file written, no signal sent. Each network\n"
+     "step gives up after SECONDS (default 5). Secrets are never shown.\n"
+     "With --json, prints one object:\n"
+     "  {\"schema\": 1, \"result\": \"ok\"|\"warn\"|\"fail\", \"exit_status\": 0|1|2,\n"
+     "   \"time_ms\": INT, \"timeout_ms\": INT, \"checks\": [{\"name\", \"result\":\n"
+     "   \"ok\"|\"warn\"|\"fail\"|\"skipped\", \"time_ms\", \"detail\", \"hint\"}, ...],\n"
+     "   \"services\": [{\"id\", \"name\", \"port\", \"ext_port\"}, ...]}\n"
+     "Exit status: 0 every check ok, 1 warnings only, 2 at least one failure.\n",
+     DoctorCmd},
     {nullptr, nullptr, nullptr, nullptr},
 };
 

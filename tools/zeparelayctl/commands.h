@@ -16,8 +16,9 @@ using namespace zepatools;
 using Args = std::vector<std::string>;
 
 struct Options {
-    bool json = false;   // status --json
+    bool json = false;   // status --json, doctor --json
     bool debug = false;  // status --debug
+    int timeoutMs = -1;  // doctor --timeout, -1: its default
 };
 
 struct Command {

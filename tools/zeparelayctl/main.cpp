@@ -2,6 +2,7 @@
 #include <getopt.h>
 
 #include <cstdio>
+#include <cstdlib>
 #include <cstring>
 #include <string>
 
@@ -45,12 +46,17 @@ const Command* Find(const std::string& name) {
 }  // namespace
 
 int main(int argc, char** argv) {
-    enum { OPT_ROOT = 256, OPT_JSON, OPT_DEBUG };
+    enum { OPT_ROOT = 256, OPT_JSON, OPT_DEBUG, OPT_TIMEOUT };
     const option longOptions[] = {
-        {"root", required_argument, nullptr, OPT_ROOT}, {"quiet", no_argument, nullptr, 'q'},
-        {"verbose", no_argument, nullptr, 'v'},         {"help", no_argument, nullptr, 'h'},
-        {"version", no_argument, nullptr, 'V'},         {"json", no_argument, nullptr, OPT_JSON},
-        {"debug", no_argument, nullptr, OPT_DEBUG},     {nullptr, 0, nullptr, 0},
+        {"root", required_argument, nullptr, OPT_ROOT},
+        {"quiet", no_argument, nullptr, 'q'},
+        {"verbose", no_argument, nullptr, 'v'},
+        {"help", no_argument, nullptr, 'h'},
+        {"version", no_argument, nullptr, 'V'},
+        {"json", no_argument, nullptr, OPT_JSON},
+        {"debug", no_argument, nullptr, OPT_DEBUG},
+        {"timeout", required_argument, nullptr, OPT_TIMEOUT},
+        {nullptr, 0, nullptr, 0},
     };
     zeparelayctl::Options opt;
     bool help = false;
@@ -83,6 +89,16 @@ int main(int argc, char** argv) {
             case OPT_DEBUG:
                 opt.debug = true;
                 break;
+            case OPT_TIMEOUT: {
+                char* end = nullptr;
+                const double seconds = strtod(optarg, &end);
+                if (end == optarg || *end != '\0' || !(seconds >= 0.1 && seconds <= 60)) {
+                    fprintf(stderr, "zeparelayctl: --timeout %s: give seconds between 0.1 and 60\n", optarg);
+                    return EXIT_USAGE;
+                }
+                opt.timeoutMs = static_cast<int>(seconds * 1000);
+                break;
+            }
             default:  // getopt has named the option
                 fputs("Try 'zeparelayctl --help'.\n", stderr);
                 return EXIT_USAGE;
@@ -106,8 +122,16 @@ int main(int argc, char** argv) {
         printf("Usage: zeparelayctl [--root DIR] %s\n\n%s", cmd->synopsis, cmd->help);
         return EXIT_OK;
     }
-    if ((opt.json || opt.debug) && strcmp(cmd->name, "status") != 0) {
-        fprintf(stderr, "zeparelayctl: --json and --debug belong to \"status\"\n");
+    if (opt.debug && strcmp(cmd->name, "status") != 0) {
+        fprintf(stderr, "zeparelayctl: --debug belongs to \"status\"\n");
+        return EXIT_USAGE;
+    }
+    if (opt.json && strcmp(cmd->name, "status") != 0 && strcmp(cmd->name, "doctor") != 0) {
+        fprintf(stderr, "zeparelayctl: --json belongs to \"status\" and \"doctor\"\n");
+        return EXIT_USAGE;
+    }
+    if (opt.timeoutMs > 0 && strcmp(cmd->name, "doctor") != 0) {
+        fprintf(stderr, "zeparelayctl: --timeout belongs to \"doctor\"\n");
         return EXIT_USAGE;
     }
     // The library logs to standard error; in a tool that would mix its lines
