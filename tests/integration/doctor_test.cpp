@@ -170,6 +170,42 @@ TEST_F(Doctor, EveryCheckOkOnTheStagedAppliance) {
     EXPECT_EQ(std::string::npos, text.out.find('\033'));
 }
 
+TEST_F(Doctor, StatusFileTellsWhenResultsCameAndWhatIsNext) {
+    const Json::Value::Int64 before = time(nullptr);
+    StartRegistered();
+    // The keep-alive after the mapping is planned once the outcome is recorded.
+    ASSERT_TRUE(WaitUntil([&] { return StatusFile()["alias_retry_at"].isIntegral(); }));
+    const Json::Value file = StatusFile();
+    EXPECT_GE(file["registration_at"].asInt64(), before);
+    EXPECT_LE(file["registration_at"].asInt64(), file["alias_at"].asInt64());
+    // Registered: no registration attempt is due.
+    EXPECT_TRUE(file["registration_retry_at"].isNull());
+    // The keep-alive comes after the polling time (8 hours at least).
+    EXPECT_GE(file["alias_retry_at"].asInt64(), file["alias_at"].asInt64() + 28800);
+    const Json::Value alias = Check(RunDoctor(true).report, "daemon.alias");
+    EXPECT_NE(std::string::npos, alias["detail"].asString().find("next exchange in "))
+        << alias["detail"].asString();
+
+    // A refused registration: when it failed, and when the next attempt comes.
+    Json::Value plan;
+    plan["path"] = "/Serv.php";
+    plan["status"] = 503;  // busy
+    plan["body"] = "busy";
+    plan["count"] = 5;
+    ASSERT_TRUE(server.scriptRaw(plan));
+    ASSERT_EQ(0, Ctl({"reload"}));
+    ASSERT_TRUE(WaitUntil([&] { return StatusFile()["registration_retry_at"].isIntegral(); }));
+    const Json::Value failed = StatusFile();
+    EXPECT_EQ(3, failed["state"].asInt());
+    EXPECT_GT(failed["registration_retry_at"].asInt64(), failed["registration_at"].asInt64());
+    Run run = RunDoctor(true);
+    const Json::Value reg = Check(run.report, "daemon.registration");
+    EXPECT_EQ("fail", reg["result"].asString());
+    EXPECT_NE(std::string::npos, reg["detail"].asString().find("next attempt in "))
+        << reg["detail"].asString();
+    EXPECT_NE(std::string::npos, reg["hint"].asString().find("busy")) << reg["hint"].asString();
+}
+
 TEST_F(Doctor, JsonFollowsItsSchema) {
     StartRegistered();
     Run run = RunDoctor(true);

@@ -728,6 +728,13 @@ private:
                         "key",
                     "if UDP is blocked on the way, the tunnel falls back to TCP (slower)", t);
                 break;
+            case UdpVpnProbe::BLOCKED:
+                Add("tunnel.relay_udp", Verdict::WARN, "UDP " + where + ": " + udp.detail,
+                    "this appliance's routing or firewall keeps UDP from the relay: the tunnel falls back to "
+                    "TCP "
+                    "(slower); allow UDP to port 443 for the faster tunnel",
+                    t);
+                break;
             case UdpVpnProbe::OTHER:
                 Add("tunnel.relay_udp", Verdict::WARN, "UDP " + where + ": " + udp.detail,
                     "something other than the relay's VPN server answers there", t);

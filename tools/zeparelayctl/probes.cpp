@@ -53,6 +53,12 @@ bool SocketAddress(const std::string& ip, int port, sockaddr_storage& sa, sockle
     return true;
 }
 
+// A datagram this machine refuses to send: a blackhole or prohibit route, no
+// route at all, or a firewall rule on the way out.
+bool LocallyBlocked(int err) {
+    return err == EINVAL || err == EPERM || err == EACCES || err == ENETUNREACH || err == EHOSTUNREACH;
+}
+
 // ---- HTTP probe --------------------------------------------------------------
 
 const size_t kMaxBody = 64 * 1024;
@@ -315,9 +321,14 @@ UdpVpnProbe ProbeVpnUdp(const std::string& ip, int port, int timeoutMs) {
         return result;
     }
     const int fd = socket(sa.ss_family, SOCK_DGRAM | SOCK_CLOEXEC, 0);
-    if (fd < 0 || connect(fd, reinterpret_cast<sockaddr*>(&sa), len) != 0) {
+    if (fd < 0) {
         result.detail = std::string("no socket: ") + strerror(errno);
-        if (fd >= 0) close(fd);
+        return result;
+    }
+    if (connect(fd, reinterpret_cast<sockaddr*>(&sa), len) != 0) {
+        result.outcome = LocallyBlocked(errno) ? UdpVpnProbe::BLOCKED : UdpVpnProbe::ERROR;
+        result.detail = std::string("not sent: ") + strerror(errno);
+        close(fd);
         return result;
     }
     // Opcode 7 (client hard reset, version 2) with key id 0, a random session
@@ -331,8 +342,10 @@ UdpVpnProbe ProbeVpnUdp(const std::string& ip, int port, int timeoutMs) {
     // Sent twice (once more at half time): one lost datagram is no verdict.
     bool resent = false;
     if (send(fd, packet, sizeof(packet), 0) < 0) {
-        result.outcome = errno == ECONNREFUSED ? UdpVpnProbe::REFUSED : UdpVpnProbe::ERROR;
-        result.detail = strerror(errno);
+        result.outcome = errno == ECONNREFUSED   ? UdpVpnProbe::REFUSED
+                         : LocallyBlocked(errno) ? UdpVpnProbe::BLOCKED
+                                                 : UdpVpnProbe::ERROR;
+        result.detail = std::string("not sent: ") + strerror(errno);
         close(fd);
         return result;
     }

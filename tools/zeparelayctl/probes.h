@@ -56,7 +56,8 @@ std::string ProbeTcp(const std::string& ip, int port, int timeoutMs);
 // Whether a VPN server answers on UDP ip:port: sends the VPN's first client
 // handshake packet (a hard reset without any key) and waits for the reply.
 struct UdpVpnProbe {
-    enum Outcome { ANSWERED, REFUSED, SILENT, OTHER, ERROR };
+    // BLOCKED: this machine's own routing or firewall does not send it.
+    enum Outcome { ANSWERED, REFUSED, SILENT, OTHER, BLOCKED, ERROR };
     Outcome outcome = ERROR;
     std::string detail;
 };
