@@ -228,13 +228,24 @@ fi
 ctl status | sed 's/^/      /'
 say "server id stored in the configuration: $(ctl server-id)"
 
-step "8. Ask for an alias update now (SIGRTMIN+1)"
+step "8. Ask the doctor: every link checked, nothing changed"
+set +e
+ctl --timeout 2 doctor | sed 's/^/      /'
+rc=${PIPESTATUS[0]}
+set -e
+say "zeparelayctl doctor exited with $rc (0 every check ok, 1 warnings, 2 a failure)"
+if [ ${#relay_args[@]} -gt 0 ]; then
+  say "the relay's VPN ports were probed from this machine's own network, which does not reach the"
+  say "relay's namespace; on an appliance those two checks test its real path to the relay"
+fi
+
+step "9. Ask for an alias update now (SIGRTMIN+1)"
 before=$(alias_requests)
 ctl update-alias | sed 's/^/      /'
 for _ in $(seq 100); do [ "$(alias_requests)" -gt "$before" ] && break; sleep 0.1; done
 say "alias requests seen by the server: $before before, $(alias_requests) after"
 
-step "9. The debug dump (SIGUSR1; written within milliseconds)"
+step "10. The debug dump (SIGUSR1; written within milliseconds)"
 # A busy machine may keep the daemon from answering within the query's few
 # milliseconds (exit status 11): asking again is what any caller does.
 dump=""
@@ -246,7 +257,7 @@ done
 [ -n "$dump" ] || { echo "demo: the daemon gave no debug dump" >&2; exit 1; }
 printf '%s\n' "$dump" | show_dump | sed 's/^/      /'
 
-step "10. Switch the relay off, then on again"
+step "11. Switch the relay off, then on again"
 ctl disable | sed 's/^/      /'
 wait_for 10 "state: logout" ctl status
 ctl status | sed 's/^/      /'
@@ -255,7 +266,7 @@ wait_for 20 "state: connected" ctl status
 [ ${#relay_args[@]} -gt 0 ] && wait_for 60 "tunnel: READY" ctl status
 ctl status | sed 's/^/      /'
 
-step "11. The appliance's web UI from outside, through the relay"
+step "12. The appliance's web UI from outside, through the relay"
 if [ ${#relay_args[@]} -gt 0 ]; then
   url="https://127.0.0.1:$https_port/demo-box/"
   say "GET $url"
@@ -275,7 +286,7 @@ else
   say "as root this step fetches the staged appliance's page through the relay's VPN tunnel"
 fi
 
-step "12. Stop the daemon"
+step "13. Stop the daemon"
 ctl stop | sed 's/^/      /'
 set +e
 ctl status | sed 's/^/      /'
