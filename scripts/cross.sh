@@ -1,7 +1,11 @@
 #!/usr/bin/env bash
 # Cross-builds the library, the SDK stand-in, the daemon, the control tool and
 # the tests for an ARM target and runs the tests under qemu-user through CTest.
-#   usage: scripts/cross.sh arm64|armhf [--no-test] [--figures] [--jobs N]
+#   usage: scripts/cross.sh arm64|armhf [--no-test] [--packages] [--figures] [--jobs N] [--setup-only]
+# --packages also builds and checks the target's Debian packages (the test
+# package.debian_packages, left out otherwise). --figures prints the stripped
+# sizes of the library, the SDK, the daemon and the control tool and, after
+# the tests, the daemon's memory once connected (scripts/daemon_footprint.sh).
 # Installs what it needs (as root; idempotent): the cross compilers
 # (crossbuild-essential-ARCH) and qemu-user-static. The target's libraries
 # come from Debian's ARCH packages unpacked into a sysroot
@@ -20,10 +24,14 @@ arch=${1:-}
 shift || true
 run_tests=1
 figures=0
+setup_only=0
+packages=0
 jobs=$(nproc 2>/dev/null || echo 2)
 while [ $# -gt 0 ]; do
   case $1 in
     --no-test) run_tests=0 ;;
+    --setup-only) setup_only=1 ;;
+    --packages) packages=1 ;;
     --figures) figures=1 ;;
     --jobs) jobs=$2; shift ;;
     *) echo "cross.sh: unknown option $1" >&2; exit 2 ;;
@@ -33,7 +41,7 @@ done
 case $arch in
   arm64) triplet=aarch64-linux-gnu; qemu=qemu-aarch64-static; binfmt=qemu-aarch64; machine=AArch64 ;;
   armhf) triplet=arm-linux-gnueabihf; qemu=qemu-arm-static; binfmt=qemu-arm; machine=ARM ;;
-  *) echo "usage: scripts/cross.sh arm64|armhf [--no-test] [--figures] [--jobs N]" >&2; exit 2 ;;
+  *) echo "usage: scripts/cross.sh arm64|armhf [--no-test] [--figures] [--jobs N] [--setup-only] [--packages]" >&2; exit 2 ;;
 esac
 
 step() { printf '\n==> [%s] %s\n' "$arch" "$*"; }
@@ -75,7 +83,7 @@ fi
 target_pkgs=(libjsoncpp-dev libcurl4-openssl-dev libssl-dev libdaemon-dev libsystemd-dev libboost-dev
   libgtest-dev libgmock-dev libc6 libstdc++6 libgcc-s1)
 stamp=$sysroot/.zepa-packages
-want="$arch ${target_pkgs[*]}"
+want="2 $arch ${target_pkgs[*]}"
 if [ -f "$stamp" ] && [ "$(cat "$stamp")" = "$want" ]; then
   step "Sysroot $sysroot is up to date"
 else
@@ -121,8 +129,12 @@ index still out of sync on the mirror is the usual cause: try again later)" 3
   fi
   mkdir -p "$sysroot"
   count=0
+  # The packages' shlibs lines tell scripts/package.sh --arch what the
+  # binaries' dependencies are.
+  : >"$sysroot/.zepa-shlibs"
   for deb in "$aptdir"/cache/archives/*.deb; do
     dpkg-deb -x "$deb" "$sysroot"
+    dpkg-deb --ctrl-tarfile "$deb" | tar -xO ./shlibs 2>/dev/null >>"$sysroot/.zepa-shlibs" || true
     count=$((count + 1))
   done
   # Absolute links (libfoo.so -> /lib/...) must point into the sysroot.
@@ -170,6 +182,11 @@ else
   fi
 fi
 
+if [ $setup_only = 1 ]; then
+  step "Set up: compilers, qemu and the sysroot $sysroot"
+  exit 0
+fi
+
 # --- configure and build -------------------------------------------------------
 launcher=()
 if command -v ccache >/dev/null; then
@@ -209,13 +226,19 @@ if [ $binfmt_ok = 0 ]; then
 fi
 
 # --- tests ---------------------------------------------------------------------
-step "Tests under $qemu ($(cd "$build/obj" && ctest -N | sed -n 's/^Total Tests: //p') tests, -j$jobs)"
+step "Tests under $qemu (-j$jobs)"
 t0=$(date +%s)
 set +e
-(cd "$build/obj" && ctest -j "$jobs" --output-on-failure --timeout 300) | tee "$build/ctest.log"
+exclude=()
+[ $packages = 1 ] || exclude=(-E '^package\.')
+(cd "$build/obj" && ctest -j "$jobs" --output-on-failure --timeout 300 "${exclude[@]}") | tee "$build/ctest.log"
 rc=${PIPESTATUS[0]}
 set -e
 echo "tests took $(($(date +%s) - t0)) s under qemu ($arch)"
 grep -E '^[[:space:]]*[0-9]+% tests passed' "$build/ctest.log" | sed "s/^/[$arch] /" || true
 [ "$rc" -eq 0 ] || fail "tests failed under qemu (output above)"
+if [ $figures = 1 ]; then
+  step "Footprint of the daemon under $qemu"
+  "$src/scripts/daemon_footprint.sh" "$build/obj" || fail "measuring the daemon failed (above)"
+fi
 step "All tests passed under qemu ($arch)"

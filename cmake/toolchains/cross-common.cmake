@@ -16,6 +16,12 @@ set(CMAKE_C_COMPILER ${ZEPA_CROSS_TRIPLET}-gcc)
 set(CMAKE_CXX_COMPILER ${ZEPA_CROSS_TRIPLET}-g++)
 set(CMAKE_LIBRARY_ARCHITECTURE ${ZEPA_CROSS_TRIPLET})
 
+# Debian's multiarch library folder, as GNUInstallDirs picks it for native
+# builds only.
+if(NOT DEFINED CMAKE_INSTALL_LIBDIR)
+  set(CMAKE_INSTALL_LIBDIR "lib/${ZEPA_CROSS_TRIPLET}" CACHE PATH "Object code libraries (lib/<triplet>)")
+endif()
+
 # Headers and libraries from the sysroot only; programs (python3, openssl) from
 # the build machine.
 set(CMAKE_FIND_ROOT_PATH "${ZEPA_CROSS_SYSROOT}")
