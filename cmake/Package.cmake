@@ -122,6 +122,26 @@ zeparelayd registers the appliance's services with the relay's control
 server and keeps its alias registered; zeparelayctl asks it for its state
 and controls it. Ships a systemd unit (Type=notify), manuals, a logrotate
 file and an example configuration.")
+# A cross build (scripts/package.sh --arch) packages for the target. dpkg-shlibdeps reads the build machine's package
+# database, which holds none of the target's packages: the script reads the same dependencies from the shlibs files
+# of the target's packages in its sysroot and passes them in.
+if(CMAKE_CROSSCOMPILING)
+  if(NOT ZEPA_DEB_ARCHITECTURE)
+    message(FATAL_ERROR "a cross build needs ZEPA_DEB_ARCHITECTURE (set by cmake/toolchains/<arch>.cmake)")
+  endif()
+  set(CPACK_DEBIAN_PACKAGE_ARCHITECTURE ${ZEPA_DEB_ARCHITECTURE})
+  set(CPACK_DEBIAN_PACKAGE_SHLIBDEPS OFF)
+  foreach(component SDK RUNTIME DAEMON)
+    if(ZEPA_DEB_SHLIBS_${component})
+      if(CPACK_DEBIAN_${component}_PACKAGE_DEPENDS)
+        string(APPEND CPACK_DEBIAN_${component}_PACKAGE_DEPENDS ", ${ZEPA_DEB_SHLIBS_${component}}")
+      else()
+        set(CPACK_DEBIAN_${component}_PACKAGE_DEPENDS "${ZEPA_DEB_SHLIBS_${component}}")
+      endif()
+    endif()
+  endforeach()
+endif()
+
 configure_file(${ZEPA_PACKAGING_DIR}/debian/conffiles.in ${PROJECT_BINARY_DIR}/packaging/daemon/conffiles @ONLY)
 set(CPACK_DEBIAN_DAEMON_PACKAGE_CONTROL_EXTRA ${PROJECT_BINARY_DIR}/packaging/daemon/conffiles)
 

@@ -10,6 +10,7 @@
 
 #include <cerrno>
 #include <csignal>
+#include <cstdint>
 #include <cstring>
 #include <ctime>
 #include <exception>
@@ -35,11 +36,11 @@ std::string RandomSuffix() {
     unsigned char bytes[RANDOM_CHARS];
     if (getrandom(bytes, sizeof(bytes), GRND_NONBLOCK) != static_cast<ssize_t>(sizeof(bytes))) {
         // Unpredictability is a bonus: the exclusive create is what keeps us safe.
-        unsigned long mix = static_cast<unsigned long>(time(nullptr)) ^
-                            (static_cast<unsigned long>(getpid()) << 16) ^
-                            static_cast<unsigned long>(clock());
+        // 64 bits on every target: the generator's constants and shift need them.
+        uint64_t mix = static_cast<uint64_t>(time(nullptr)) ^ (static_cast<uint64_t>(getpid()) << 16) ^
+                       static_cast<uint64_t>(clock());
         for (unsigned char& b : bytes) {
-            mix = mix * 6364136223846793005UL + 1442695040888963407UL;
+            mix = mix * 6364136223846793005ULL + 1442695040888963407ULL;
             b = static_cast<unsigned char>(mix >> 33);
         }
     }

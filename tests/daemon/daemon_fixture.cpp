@@ -166,7 +166,7 @@ void DaemonTest::SetUp() {
     root.mkdir("/var/log");
     root.mkdir("/tmp");
     root.mkdir("/usr/zepa/etc/zeparelayd");
-    prctl(PR_SET_CHILD_SUBREAPER, 1);
+    isSubreaper = prctl(PR_SET_CHILD_SUBREAPER, 1) == 0;
     StartSyslogRecorder();
 }
 

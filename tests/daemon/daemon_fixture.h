@@ -72,6 +72,9 @@ std::string DebugFile(pid_t pid);
 // Base fixture: private root, syslog recorder, subreaper.
 class DaemonTest : public zepatest::RootTest {
 protected:
+    // False where the kernel interface is refused, as qemu-user does: a
+    // daemon child then goes to init instead of to the test.
+    bool isSubreaper = false;
     void SetUp() override;
     void TearDown() override;
     // root + "/var/run/zeparelayd.pid"
@@ -82,5 +85,11 @@ protected:
 };
 
 }  // namespace daemontest
+
+// For tests that wait for a daemonised grandchild re-parented to them.
+#define ZEPA_SKIP_WITHOUT_SUBREAPER()                                                                  \
+    if (!isSubreaper)                                                                                  \
+    GTEST_SKIP() << "PR_SET_CHILD_SUBREAPER is refused here (qemu-user refuses it): the daemon child " \
+                    "would not be re-parented to the test, which could not wait for it"
 
 #endif

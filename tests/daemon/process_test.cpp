@@ -127,6 +127,7 @@ TEST_F(ProcessTest, ForegroundInitWithoutPidDirectoryFailsWithAMessage) {
 }
 
 TEST_F(ProcessTest, DaemonStartsDetachedHoldsThePidFileAndRefusesASecondStart) {
+    ZEPA_SKIP_WITHOUT_SUBREAPER();
     const pid_t testSession = getsid(0);
     int launcher = RunInChild([&] {
         StderrTo("/launcher.log");
@@ -198,6 +199,7 @@ TEST_F(ProcessTest, ChildWithoutPidFileMakesTheParentExitWithFour) {
 void Wake(int) {}
 
 TEST_F(ProcessTest, ParentThatGetsNoWordExitsWith255) {
+    ZEPA_SKIP_WITHOUT_SUBREAPER();
     fflush(nullptr);
     pid_t launcher = fork();
     if (launcher == 0) {
@@ -253,6 +255,7 @@ TEST_F(ProcessTest, WithoutDescriptorsForThePipeInitFailsWithoutForking) {
 }
 
 TEST_F(ProcessTest, EachDaemonStartBeginsAFreshLogFile) {
+    ZEPA_SKIP_WITHOUT_SUBREAPER();
     const std::string logFile = root.path("/var/log/custom.log");
     zepatest::WriteFile(logFile, "old content\n");
     int launcher = RunInChild([&] {
@@ -273,6 +276,7 @@ TEST_F(ProcessTest, EachDaemonStartBeginsAFreshLogFile) {
 // logrotate's copytruncate empties the file under the running daemon: the next
 // line must land at its start, not after a hole as long as the old content.
 TEST_F(ProcessTest, AfterATruncationByAnotherProcessTheNextLineStartsTheFile) {
+    ZEPA_SKIP_WITHOUT_SUBREAPER();
     const std::string logFile = root.path("/var/log/custom.log");
     int launcher = RunInChild([&] {
         Daemon::SetLogFile(logFile, 4);
@@ -293,6 +297,7 @@ TEST_F(ProcessTest, AfterATruncationByAnotherProcessTheNextLineStartsTheFile) {
 }
 
 TEST_F(ProcessTest, WithoutLogFileTheDaemonsStderrStaysOnTheNullDevice) {
+    ZEPA_SKIP_WITHOUT_SUBREAPER();
     int launcher = RunInChild([&] {
         Daemon::SetName("zeparelayd");
         if (!Daemon::Init(true)) return 90;
@@ -307,6 +312,7 @@ TEST_F(ProcessTest, WithoutLogFileTheDaemonsStderrStaysOnTheNullDevice) {
 }
 
 TEST_F(ProcessTest, EmptySetLogFileAfterDaemonisingAppendsToTheDefaultLogFile) {
+    ZEPA_SKIP_WITHOUT_SUBREAPER();
     root.write("/var/log/zeparelayd.log", "earlier line\n");
     int launcher = RunInChild([&] {
         Daemon::SetName("zeparelayd");
@@ -324,6 +330,7 @@ TEST_F(ProcessTest, EmptySetLogFileAfterDaemonisingAppendsToTheDefaultLogFile) {
 }
 
 TEST_F(ProcessTest, SetLogFileAfterDaemonisingAppendsToTheNewFile) {
+    ZEPA_SKIP_WITHOUT_SUBREAPER();
     const std::string first = root.path("/var/log/first.log");
     const std::string second = root.path("/var/log/second.log");
     zepatest::WriteFile(second, "kept\n");

@@ -3,10 +3,14 @@
 # $ZEPA_PACKAGE_DIR), checks what each one holds and declares, extracts them
 # into a throwaway root with dpkg-deb -x and runs the installed programs and
 # the systemd unit check from there.
-#   usage: check_packages.sh SOURCE_DIR PACKAGE_BUILD_DIR
+# With ARCH (arm64, armhf) the packages are cross-built for it
+# (scripts/package.sh --arch) and the programs run under qemu when binfmt_misc
+# knows it (scripts/cross.sh registers it).
+#   usage: check_packages.sh SOURCE_DIR PACKAGE_BUILD_DIR [ARCH]
 set -euo pipefail
 src=$1
 build=$2
+arch=${3:-}
 
 if ! command -v dpkg-deb >/dev/null; then
   echo "SKIPPED: dpkg-deb is not installed (not a Debian system); the packages were not built or checked"
@@ -21,8 +25,8 @@ if [ -n "${ZEPA_PACKAGE_DIR:-}" ]; then
   debs=$ZEPA_PACKAGE_DIR
   echo "== taking the packages from $debs"
 else
-  echo "== building the packages (scripts/package.sh $build)"
-  "$src/scripts/package.sh" "$build"
+  echo "== building the packages (scripts/package.sh ${arch:+--arch $arch }$build)"
+  "$src/scripts/package.sh" ${arch:+--arch "$arch"} "$build"
   debs=$build/packages
 fi
 
@@ -50,9 +54,27 @@ field libzeparelayd1 Depends | grep "libjsoncpp" >/dev/null || fail "libzeparela
 dpkg-deb --ctrl-tarfile "$(deb libzeparelayd1)" | tar -xO ./shlibs | grep -x "libzeparelayd 1 libzeparelayd1 (= $full)" >/dev/null \
   || fail "libzeparelayd1 has no shlibs entry for its SONAME"
 
+echo "== architecture"
+# The ELF machine every binary must be built for, as readelf names it.
+case ${arch:-native} in
+  arm64) machine=AArch64; triplet=aarch64-linux-gnu; qemu_entry=qemu-aarch64 ;;
+  armhf) machine=ARM; triplet=arm-linux-gnueabihf; qemu_entry=qemu-arm ;;
+  native)
+    arch=$(dpkg --print-architecture)
+    triplet=$(dpkg-architecture -qDEB_HOST_MULTIARCH 2>/dev/null || gcc -print-multiarch)
+    machine=$(readelf -h "$(command -v dpkg-deb)" | sed -n 's/^ *Machine: *//p')
+    qemu_entry= ;;
+  *) fail "unknown architecture '$arch'" ;;
+esac
+for p in libzepasdk1 libzeparelayd1 libzeparelayd-dev zeparelayd; do
+  [ "$(field $p Architecture)" = "$arch" ] || fail "$p: Architecture is '$(field $p Architecture)', not $arch"
+done
+echo "Architecture $arch, ELF machine $machine, multiarch $triplet"
+
 echo "== contents"
 multiarch=$(dpkg-deb -c "$(deb libzeparelayd1)" | awk '{print $6}' | sed -n 's|^\./usr/lib/\([^/]*\)/libzeparelayd\.so\.1$|\1|p')
 [ -n "$multiarch" ] || fail "libzeparelayd1 has no usr/lib/<triplet>/libzeparelayd.so.1"
+[ "$multiarch" = "$triplet" ] || fail "libzeparelayd1 puts its library in usr/lib/$multiarch, not usr/lib/$triplet"
 lib=/usr/lib/$multiarch
 holds libzepasdk1 "$lib/libzepasdk.so.1"
 lacks libzepasdk1 'libzepasdk\.so$'
@@ -78,15 +100,40 @@ done
 echo "== extract into a throwaway root"
 root=$work/root
 for p in libzepasdk1 libzeparelayd1 libzeparelayd-dev zeparelayd; do dpkg-deb -x "$(deb $p)" "$root"; done
-soname=$(objdump -p "$root$lib/libzeparelayd.so.1" | awk '/SONAME/ {print $2}')
+soname=$(readelf -d "$root$lib/libzeparelayd.so.1" | sed -n 's/.*(SONAME).*\[\(.*\)\]/\1/p')
 [ "$soname" = "libzeparelayd.so.1" ] || fail "SONAME is '$soname'"
+elves=0
+while IFS= read -r -d '' f; do
+  [ "$(head -c 4 "$f" | od -An -c | tr -d ' ')" = '177ELF' ] || continue
+  got=$(readelf -h "$f" | sed -n 's/^ *Machine: *//p')
+  [ "$got" = "$machine" ] || fail "${f#"$root"} is built for '$got', not $machine"
+  elves=$((elves + 1))
+done < <(find "$root" -type f -print0)
+[ "$elves" -ge 4 ] || fail "only $elves ELF files in the packages"
+echo "$elves ELF files, all for $machine"
 
 echo "== the installed programs run from there"
+if [ -n "$qemu_entry" ] && ! grep -qx enabled "/proc/sys/fs/binfmt_misc/$qemu_entry" 2>/dev/null; then
+  echo "SKIPPED part: $qemu_entry is not registered in binfmt_misc (scripts/cross.sh $arch registers it as root),"
+  echo "so the $arch programs cannot run here"
+  echo "package check passed"
+  exit 0
+fi
+if [ -n "$qemu_entry" ]; then
+  # The target's own libraries for qemu's loader.
+  export QEMU_LD_PREFIX=$src/build/cross-$arch/sysroot
+fi
 # Their RUNPATH ($ORIGIN/../lib/<triplet>) finds the staged libraries of ours
 # they need, not any the system may have.
 for prog in usr/sbin/zeparelayd usr/bin/zeparelayctl; do
-  needed=$(objdump -p "$root/$prog" | awk '/NEEDED/ && /libzep/ {print $2}')
+  needed=$(readelf -d "$root/$prog" | sed -n 's/.*(NEEDED).*\[\(libzep.*\)\]/\1/p')
   [ -n "$needed" ] || fail "$prog needs none of the packaged libraries"
+  if [ -n "$qemu_entry" ]; then
+    # ldd cannot look into a foreign program: its RUNPATH must name the
+    # packaged folder, and the run below proves that the loader follows it.
+    readelf -d "$root/$prog" | grep -qF "[\$ORIGIN/../lib/$triplet]" || fail "$prog has no RUNPATH \$ORIGIN/../lib/$triplet"
+    continue
+  fi
   loaded=$(ldd "$root/$prog")
   for so in $needed; do
     grep -qF "$so => $root/" <<<"$loaded" || { echo "$loaded"; fail "$prog does not load the staged $so"; }
