@@ -10,6 +10,7 @@ PACKAGES=(
   python3 openssl ca-certificates procps iproute2 clang-format clang-tidy
   libsystemd-dev systemd dpkg-dev file lintian
   openvpn
+  python3-matplotlib
 )
 
 missing=()

@@ -25,6 +25,23 @@ int64_t Doubling(int64_t first, int n, int64_t cap) {
 
 }  // namespace
 
+int64_t BackoffRule::WaitMs(int n, int64_t previousMs, const RandomSource& random) const {
+    const int64_t cap = std::max(capMs, firstMs);
+    if (jitter == JitterKind::DECORRELATED) {
+        const int64_t upper = std::max(firstMs, std::min(cap, 3 * std::max(previousMs, firstMs)));
+        return firstMs + Jitter(random, upper - firstMs);
+    }
+    const int64_t delay = Doubling(firstMs, n, cap);
+    switch (jitter) {
+        case JitterKind::FULL:
+            return Jitter(random, delay);
+        case JitterKind::EQUAL:
+            return delay - delay / 2 + Jitter(random, delay / 2);
+        default:
+            return delay + Jitter(random, delay * addedPercent / 100);
+    }
+}
+
 int64_t Deadline::RemainingMs() const {
     if (_dueMs < 0) return -1;
     return std::max<int64_t>(_dueMs - _clock.NowMs(), 0);
@@ -32,8 +49,16 @@ int64_t Deadline::RemainingMs() const {
 
 // ---- registration ------------------------------------------------------------
 
-RegistrationPolicy::RegistrationPolicy(const Clock& clock, RandomSource random)
-    : _random(std::move(random)), _due(clock), _failures(0), _moves(0), _halted(false) {}
+RegistrationPolicy::RegistrationPolicy(const Clock& clock, RandomSource random, RegistrationRules rules)
+    : _random(std::move(random)),
+      _rules(rules),
+      _due(clock),
+      _failures(0),
+      _moves(0),
+      _halted(false),
+      _lastBackoffMs(0) {}
+
+int64_t RegistrationPolicy::OnStart() { return Arm(Jitter(_random, _rules.startSpreadMs)); }
 
 bool RegistrationPolicy::NeedsReload(RELAYD_RET err) {
     return err == RELAYD_ERR_AUTH || err == RELAYD_ERR_NOT_SUPPORT || err == RELAYD_ERR_API_KEY_EXPIRED ||
@@ -41,8 +66,7 @@ bool RegistrationPolicy::NeedsReload(RELAYD_RET err) {
 }
 
 int64_t RegistrationPolicy::BackoffMs(int n) const {
-    const int64_t delay = Doubling(FIRST_DELAY_MS, n, MAX_DELAY_MS);
-    return delay + Jitter(_random, delay / 4);
+    return _rules.failure.WaitMs(n, n > 1 ? _lastBackoffMs : 0, _random);
 }
 
 int64_t RegistrationPolicy::Arm(int64_t delayMs) {
@@ -56,19 +80,23 @@ int64_t RegistrationPolicy::OnFailure(RELAYD_RET err) {
         _due.Clear();
         return WAIT_FOR_RELOAD;
     }
-    if (err == RELAYD_ERR_RESOLV) return Arm(RESOLVE_DELAY_MS);
+    if (err == RELAYD_ERR_RESOLV) return Arm(_rules.resolveMs + Jitter(_random, _rules.resolveJitterMs));
     ++_failures;
-    return Arm(BackoffMs(_failures));
+    _lastBackoffMs = BackoffMs(_failures);
+    return Arm(_lastBackoffMs);
 }
 
 int64_t RegistrationPolicy::OnServerMoved() {
     ++_moves;
-    return Arm(_moves == 1 ? 0 : BackoffMs(_moves - 1));
+    if (_moves == 1) return Arm(Jitter(_random, _rules.moveSpreadMs));
+    _lastBackoffMs = BackoffMs(_moves - 1);
+    return Arm(_lastBackoffMs);
 }
 
 void RegistrationPolicy::OnSuccess() {
     _failures = 0;
     _moves = 0;
+    _lastBackoffMs = 0;
     _due.Clear();
 }
 
@@ -164,23 +192,23 @@ void AliasPolicy::Dump(Json::Value& out) const {
 
 // ---- tunnel ------------------------------------------------------------------
 
-TunnelPolicy::TunnelPolicy(const Clock& clock, RandomSource random)
-    : _random(std::move(random)), _due(clock), _failures(0) {}
+TunnelPolicy::TunnelPolicy(const Clock& clock, RandomSource random, TunnelRules rules)
+    : _random(std::move(random)), _rules(rules), _due(clock), _failures(0), _lastBackoffMs(0) {}
 
 int64_t TunnelPolicy::BackoffMs(int n) const {
-    const int64_t delay = Doubling(FIRST_DELAY_MS, n, MAX_DELAY_MS);
-    return delay + Jitter(_random, delay / 4);
+    return _rules.failure.WaitMs(n, n > 1 ? _lastBackoffMs : 0, _random);
 }
 
 int64_t TunnelPolicy::OnFailure() {
     ++_failures;
-    const int64_t delay = BackoffMs(_failures);
-    _due.Arm(delay);
-    return delay;
+    _lastBackoffMs = BackoffMs(_failures);
+    _due.Arm(_lastBackoffMs);
+    return _lastBackoffMs;
 }
 
 void TunnelPolicy::OnUp() {
     _failures = 0;
+    _lastBackoffMs = 0;
     _due.Clear();
 }
 

@@ -19,6 +19,39 @@ namespace zeparelayd {
 // Source of jitter: random() in the daemon, chosen values in tests.
 using RandomSource = std::function<long()>;
 
+// How a wait after repeated failures is spread, d being the doubled wait:
+//   ADDED: d plus up to addedPercent of d;   FULL: anywhere in [0, d];
+//   EQUAL: d/2 plus up to d/2;               DECORRELATED: anywhere between
+//   the first wait and three times the previous one, at most the cap.
+enum class JitterKind { ADDED, FULL, EQUAL, DECORRELATED };
+
+// A back-off: first wait, doubled per consecutive failure up to cap, spread
+// by jitter.
+struct BackoffRule {
+    int64_t firstMs;
+    int64_t capMs;
+    JitterKind jitter;
+    int addedPercent;  // ADDED only
+
+    // The wait for the n-th consecutive failure (n >= 1); previousMs is the
+    // last wait (DECORRELATED only; 0 before the first).
+    int64_t WaitMs(int n, int64_t previousMs, const RandomSource& random) const;
+};
+
+// The registration's rules; the daemon runs on the defaults, the fleet
+// simulator also on variants of them.
+struct RegistrationRules {
+    BackoffRule failure{30000, 1800000, JitterKind::ADDED, 25};
+    int64_t resolveMs = 10000;    // after a failed name lookup ...
+    int64_t resolveJitterMs = 0;  // ... plus up to this much
+    int64_t moveSpreadMs = 0;     // first move: up to this much (0: at once)
+    int64_t startSpreadMs = 0;    // first registration after start: up to this much
+};
+
+struct TunnelRules {
+    BackoffRule failure{2000, 300000, JitterKind::ADDED, 25};
+};
+
 // A wait that was decided, and when it runs out.
 class Deadline {
 public:
@@ -45,13 +78,14 @@ private:
 //     server that keeps sending the daemon elsewhere cannot make it loop.
 class RegistrationPolicy {
 public:
-    static constexpr int64_t FIRST_DELAY_MS = 30000;
-    static constexpr int64_t MAX_DELAY_MS = 1800000;
-    static constexpr int64_t RESOLVE_DELAY_MS = 10000;
     // Returned instead of a delay when only a reload helps.
     static constexpr int64_t WAIT_FOR_RELOAD = -1;
 
-    RegistrationPolicy(const Clock& clock, RandomSource random);
+    RegistrationPolicy(const Clock& clock, RandomSource random,
+                       RegistrationRules rules = RegistrationRules());
+
+    // The wait before the first registration after the daemon starts.
+    int64_t OnStart();
 
     // An attempt starts now: nothing is due any more.
     void OnAttempt() { _due.Clear(); }
@@ -77,10 +111,12 @@ private:
     int64_t Arm(int64_t delayMs);
 
     RandomSource _random;
+    RegistrationRules _rules;
     Deadline _due;
     int _failures;
     int _moves;
     bool _halted;
+    int64_t _lastBackoffMs;  // the last failure's wait, for decorrelated jitter
 };
 
 // What the alias cycle does next.
@@ -152,10 +188,7 @@ private:
 // that comes up, or an answer without a tunnel, starts the count afresh.
 class TunnelPolicy {
 public:
-    static constexpr int64_t FIRST_DELAY_MS = 2000;
-    static constexpr int64_t MAX_DELAY_MS = 300000;
-
-    TunnelPolicy(const Clock& clock, RandomSource random);
+    TunnelPolicy(const Clock& clock, RandomSource random, TunnelRules rules = TunnelRules());
 
     // The tunnel failed: the wait before registering again.
     int64_t OnFailure();
@@ -173,8 +206,10 @@ public:
 
 private:
     RandomSource _random;
+    TunnelRules _rules;
     Deadline _due;
     int _failures;
+    int64_t _lastBackoffMs;
 };
 
 }  // namespace zeparelayd

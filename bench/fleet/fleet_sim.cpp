@@ -1,0 +1,253 @@
+// fleet_sim: N simulated appliances on the daemon's retry rules against a
+// scripted relay; prints the request rates and recovery times per scenario,
+// writes per-second series for the plots, and checks the fleet's goals.
+#include <sys/stat.h>
+
+#include <cerrno>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <string>
+#include <vector>
+
+#include "fleet_model.h"
+
+namespace {
+
+void Usage(FILE* out) {
+    fprintf(
+        out,
+        "usage: fleet_sim [options]\n"
+        "  -n, --appliances N     fleet size (default 100000)\n"
+        "  --scenario NAME        run only this scenario (repeatable); --list names them\n"
+        "  --rules NAME           retry rules (default: shipped); --list names the variants\n"
+        "  --variants             trade-off table: every rule variant over the outage and power scenarios\n"
+        "  --seed S               jitter and fleet seed (default 1)\n"
+        "  --heartbeat S          heartbeat the control server asks for, seconds (default 300)\n"
+        "  --tunnel-percent P     share of appliances behind a tunnel (default 25)\n"
+        "  --warmup-hours H       boots of the steady fleet spread over H hours (default 16)\n"
+        "  --csv-dir DIR          write DIR/<scenario>.csv (per second: requests per kind, recovered share)\n"
+        "  --check                exit 1 when a goal is not met (each miss is printed)\n"
+        "  --list                 print the scenarios and rule variants\n");
+}
+
+bool ParseInt(const char* text, long long lo, long long hi, long long& out) {
+    char* end = nullptr;
+    errno = 0;
+    const long long v = strtoll(text, &end, 10);
+    if (errno != 0 || end == text || *end != '\0' || v < lo || v > hi) return false;
+    out = v;
+    return true;
+}
+
+const char* Value(int argc, char** argv, int& i) {
+    if (i + 1 >= argc) {
+        fprintf(stderr, "fleet_sim: %s needs a value (try --help)\n", argv[i]);
+        exit(64);
+    }
+    return argv[++i];
+}
+
+struct VariantRow {
+    std::string rules;
+    double outagePeak = 0;     // worst control or tunnel peak/steady over the outages
+    double outageRecover = 0;  // worst 99 % time over the outages, s (-1 never)
+    double powerPeak = 0;
+    double powerRecover = 0;
+    double otherPeak = 0;  // dns and server change
+    bool lockStep = false;
+    int goalsMissed = 0;
+};
+
+double WorstTime(double a, double b) {
+    if (a < 0 || b < 0) return -1;
+    return std::max(a, b);
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+    fleet::FleetConfig config;
+    std::vector<std::string> names;
+    std::string rulesName = "shipped";
+    std::string csvDir;
+    bool check = false, variants = false;
+    for (int i = 1; i < argc; ++i) {
+        const std::string arg = argv[i];
+        long long v = 0;
+        if (arg == "-h" || arg == "--help") {
+            Usage(stdout);
+            return 0;
+        } else if (arg == "-n" || arg == "--appliances") {
+            if (!ParseInt(Value(argc, argv, i), 1, 10000000, v)) {
+                fprintf(stderr, "fleet_sim: --appliances wants 1 to 10000000\n");
+                return 64;
+            }
+            config.appliances = static_cast<int>(v);
+        } else if (arg == "--scenario") {
+            names.push_back(Value(argc, argv, i));
+        } else if (arg == "--rules") {
+            rulesName = Value(argc, argv, i);
+        } else if (arg == "--variants") {
+            variants = true;
+        } else if (arg == "--seed") {
+            if (!ParseInt(Value(argc, argv, i), 0, 1LL << 62, v)) {
+                fprintf(stderr, "fleet_sim: --seed wants a non-negative number\n");
+                return 64;
+            }
+            config.seed = static_cast<uint64_t>(v);
+        } else if (arg == "--heartbeat") {
+            if (!ParseInt(Value(argc, argv, i), 10, 86400, v)) {
+                fprintf(stderr, "fleet_sim: --heartbeat wants 10 to 86400 seconds\n");
+                return 64;
+            }
+            config.heartbeatSeconds = static_cast<int>(v);
+        } else if (arg == "--tunnel-percent") {
+            if (!ParseInt(Value(argc, argv, i), 0, 100, v)) {
+                fprintf(stderr, "fleet_sim: --tunnel-percent wants 0 to 100\n");
+                return 64;
+            }
+            config.tunnelPercent = static_cast<int>(v);
+        } else if (arg == "--warmup-hours") {
+            if (!ParseInt(Value(argc, argv, i), 0, 48, v)) {
+                fprintf(stderr, "fleet_sim: --warmup-hours wants 0 to 48\n");
+                return 64;
+            }
+            config.warmupMs = v * 3600 * 1000;
+        } else if (arg == "--csv-dir") {
+            csvDir = Value(argc, argv, i);
+        } else if (arg == "--check") {
+            check = true;
+        } else if (arg == "--list") {
+            printf("scenarios:");
+            for (const fleet::Scenario& s : fleet::DefaultScenarios()) printf(" %s", s.name.c_str());
+            printf("\nrules:");
+            for (const fleet::Rules& r : fleet::RuleVariants()) printf(" %s", r.name.c_str());
+            printf("\n");
+            return 0;
+        } else {
+            fprintf(stderr, "fleet_sim: unknown option '%s' (try --help)\n", arg.c_str());
+            return 64;
+        }
+    }
+
+    std::vector<fleet::Scenario> scenarios;
+    if (names.empty()) {
+        scenarios = fleet::DefaultScenarios();
+        if (variants) {
+            scenarios.clear();
+            for (const fleet::Scenario& s : fleet::DefaultScenarios()) {
+                if (s.kind != fleet::ScenarioKind::ALIAS_DOWN) scenarios.push_back(s);
+            }
+        }
+    }
+    for (const std::string& name : names) {
+        fleet::Scenario s;
+        if (!fleet::FindScenario(name, s)) {
+            fprintf(stderr, "fleet_sim: no scenario '%s' (--list names them)\n", name.c_str());
+            return 64;
+        }
+        scenarios.push_back(s);
+    }
+    std::vector<fleet::Rules> ruleSets;
+    if (variants) {
+        ruleSets = fleet::RuleVariants();
+    } else {
+        fleet::Rules r;
+        if (!fleet::FindRules(rulesName, r)) {
+            fprintf(stderr, "fleet_sim: no rules '%s' (--list names them)\n", rulesName.c_str());
+            return 64;
+        }
+        ruleSets.push_back(r);
+    }
+    if (!csvDir.empty() && mkdir(csvDir.c_str(), 0755) != 0 && errno != EEXIST) {
+        fprintf(stderr, "fleet_sim: cannot create %s: %s\n", csvDir.c_str(), strerror(errno));
+        return 1;
+    }
+
+    std::vector<std::string> missed;
+    std::vector<VariantRow> rows;
+    const size_t total = scenarios.size() * ruleSets.size();
+    size_t done = 0;
+    for (const fleet::Rules& rules : ruleSets) {
+        VariantRow row;
+        row.rules = rules.name;
+        // A power restore is measured against the steady fleet's rates.
+        fleet::Result steady;
+        bool haveSteady = false;
+        for (const fleet::Scenario& scenario : scenarios) {
+            if (scenario.kind == fleet::ScenarioKind::POWER_RESTORE && !haveSteady) {
+                fleet::Scenario s;
+                fleet::FindScenario("steady", s);
+                fprintf(stderr, "  (steady fleet first, for the power restore's reference rates)\n");
+                steady = fleet::RunScenario(config, rules, s);
+                haveSteady = true;
+            }
+            fprintf(stderr, "[%zu/%zu] %s, rules %s, N = %d ...\n", ++done, total, scenario.name.c_str(),
+                    rules.name.c_str(), config.appliances);
+            fleet::Result r = fleet::RunScenario(config, rules, scenario, haveSteady ? &steady : nullptr);
+            if (scenario.kind == fleet::ScenarioKind::STEADY) {
+                steady = r;
+                haveSteady = true;
+            }
+            if (!variants) {
+                printf("%s", fleet::FormatResult(r).c_str());
+                fflush(stdout);
+            }
+            if (!csvDir.empty() && !variants) {
+                const std::string path = csvDir + "/" + scenario.name + ".csv";
+                if (!fleet::WriteSeriesCsv(r, path)) {
+                    fprintf(stderr, "fleet_sim: cannot write %s\n", path.c_str());
+                    return 1;
+                }
+            }
+            const std::vector<std::string> goals = fleet::CheckGoals(r);
+            row.goalsMissed += static_cast<int>(goals.size());
+            missed.insert(missed.end(), goals.begin(), goals.end());
+            double peak = 0;
+            for (const char* name : {"register", "tunnel"}) {
+                const fleet::SeriesFigures& f = r.Series(name);
+                if (f.steady > 0) peak = std::max(peak, f.peak / f.steady);
+            }
+            for (const fleet::SeriesFigures& f : r.series) row.lockStep = row.lockStep || f.lockStep;
+            switch (scenario.kind) {
+                case fleet::ScenarioKind::OUTAGE:
+                    row.outagePeak = std::max(row.outagePeak, peak);
+                    row.outageRecover = WorstTime(row.outageRecover, r.recover99);
+                    break;
+                case fleet::ScenarioKind::POWER_RESTORE:
+                    row.powerPeak = peak;
+                    row.powerRecover = r.recover99;
+                    break;
+                case fleet::ScenarioKind::DNS_FAILURE:
+                case fleet::ScenarioKind::SERVER_CHANGED:
+                    row.otherPeak = std::max(row.otherPeak, peak);
+                    break;
+                default:
+                    break;
+            }
+        }
+        rows.push_back(row);
+    }
+
+    if (variants) {
+        printf("\nTrade-off (N = %d): worst over the outages (5 min, 1 h, 6 h; refused and hanging)\n",
+               config.appliances);
+        printf("%-22s %12s %12s %11s %11s %13s %9s %7s\n", "rules", "outage peak", "outage 99%", "power peak",
+               "power 99%", "dns/move peak", "lockstep", "missed");
+        for (const VariantRow& row : rows) {
+            char o99[16], p99[16];
+            snprintf(o99, sizeof o99, row.outageRecover < 0 ? "never" : "%.0f s", row.outageRecover);
+            snprintf(p99, sizeof p99, row.powerRecover < 0 ? "never" : "%.0f s", row.powerRecover);
+            printf("%-22s %11.2fx %12s %10.2fx %11s %12.2fx %9s %7d\n", row.rules.c_str(), row.outagePeak,
+                   o99, row.powerPeak, p99, row.otherPeak, row.lockStep ? "yes" : "no", row.goalsMissed);
+        }
+    }
+    if (!missed.empty()) {
+        printf("\nGoals not met:\n");
+        for (const std::string& m : missed) printf("  %s\n", m.c_str());
+    } else {
+        printf("\nAll goals met.\n");
+    }
+    return check && !missed.empty() ? 1 : 0;
+}
