@@ -10,6 +10,7 @@
 #include <cstdio>
 #include <cstdlib>
 #include <fstream>
+#include <functional>
 #include <queue>
 #include <random>
 #include <sstream>
@@ -598,7 +599,8 @@ std::string Seconds(double s) {
 }
 
 std::string Ratio(double peak, double steady) {
-    if (steady <= 0) return "-";
+    // Below one request in 20 s the steady rate is too thin to divide by.
+    if (steady < 0.05) return "-";
     char buf[32];
     snprintf(buf, sizeof buf, "%.2f", peak / steady);
     return buf;
@@ -614,8 +616,8 @@ const char* KindName(int kind) {
 std::vector<Scenario> DefaultScenarios() {
     std::vector<Scenario> out;
     out.push_back({"steady", ScenarioKind::STEADY, 0, false});
-    for (const auto& len :
-         {std::make_pair("5m", 5 * MINUTE), std::make_pair("1h", HOUR), std::make_pair("6h", 6 * HOUR)}) {
+    for (const auto& len : {std::make_pair("1m", MINUTE), std::make_pair("5m", 5 * MINUTE),
+                            std::make_pair("1h", HOUR), std::make_pair("6h", 6 * HOUR)}) {
         out.push_back(
             {std::string("outage-") + len.first + "-refused", ScenarioKind::OUTAGE, len.second, false});
         out.push_back(
@@ -639,9 +641,61 @@ bool FindScenario(const std::string& name, Scenario& out) {
 }
 
 std::vector<Rules> RuleVariants() {
+    using zeparelayd::BackoffRule;
     std::vector<Rules> out;
-    Rules shipped;
-    out.push_back(shipped);
+    // The rules before the fleet was measured: 30 s doubling to 30 min plus up
+    // to a quarter, 10 s after a failed lookup, a tunnel retried after 2 s.
+    Rules before;
+    before.name = "before";
+    before.registration.failure = {30 * SECOND, 30 * MINUTE, JitterKind::ADDED, 25};
+    before.registration.resolveBacksOff = false;
+    before.registration.fromAttemptStart = false;
+    before.registration.startSpreadMs = 0;
+    before.tunnel.failure = {2 * SECOND, 5 * MINUTE, JitterKind::ADDED, 25};
+    out.push_back(before);
+    auto backoff = [&](const char* name, BackoffRule rule, bool fromAttemptStart = false) {
+        Rules r = before;
+        r.name = name;
+        r.registration.failure = rule;
+        r.registration.fromAttemptStart = fromAttemptStart;
+        out.push_back(r);
+        return r;
+    };
+    // The registration's back-off alone.
+    backoff("cap-4m", {30 * SECOND, 4 * MINUTE, JitterKind::ADDED, 25});
+    backoff("full-30s-5m", {30 * SECOND, 5 * MINUTE, JitterKind::FULL, 0});
+    backoff("decorr-30s-5m", {30 * SECOND, 5 * MINUTE, JitterKind::DECORRELATED, 0});
+    backoff("equal-2m-4m", {2 * MINUTE, 4 * MINUTE, JitterKind::EQUAL, 0});
+    backoff("equal-4m", {4 * MINUTE, 4 * MINUTE, JitterKind::EQUAL, 0});
+    backoff("equal-5m", {5 * MINUTE, 5 * MINUTE, JitterKind::EQUAL, 0});
+    backoff("150s+40%", {150 * SECOND, 150 * SECOND, JitterKind::ADDED, 40});
+    const Rules base = backoff("cadence-285-300s", {285 * SECOND, 285 * SECOND, JitterKind::ADDED, 5}, true);
+    // Each further rule on top of it.
+    auto plus = [&](const char* name, const std::function<void(Rules&)>& change) {
+        Rules r = base;
+        r.name = name;
+        change(r);
+        out.push_back(r);
+    };
+    plus("+tunnel-full-2m", [](Rules& r) {
+        r.tunnel.failure = {2 * MINUTE, 5 * MINUTE, JitterKind::FULL, 0};
+    });
+    plus("+tunnel-equal-2m", [](Rules& r) {
+        r.tunnel.failure = {2 * MINUTE, 5 * MINUTE, JitterKind::EQUAL, 0};
+    });
+    plus("+dns-jitter-20s", [](Rules& r) { r.registration.resolveJitterMs = 20 * SECOND; });
+    plus("+dns-backs-off", [](Rules& r) { r.registration.resolveBacksOff = true; });
+    plus("+start-spread-2m", [](Rules& r) { r.registration.startSpreadMs = 2 * MINUTE; });
+    plus("+start-spread-3m", [](Rules& r) { r.registration.startSpreadMs = 3 * MINUTE; });
+    plus("+move-spread-2m", [](Rules& r) { r.registration.moveSpreadMs = 2 * MINUTE; });
+    // The daemon's defaults: the cadence, lookups backing off, a 3-minute
+    // start-up spread; the tunnel as before.
+    out.push_back(Rules());
+    // And with the tunnel's first retry spread over two minutes as well.
+    Rules spread;
+    spread.name = "shipped+tunnel-2m";
+    spread.tunnel.failure = {2 * MINUTE, 5 * MINUTE, JitterKind::FULL, 0};
+    out.push_back(spread);
     return out;
 }
 
@@ -679,7 +733,9 @@ std::vector<std::string> CheckGoals(const Result& r) {
     const bool power = r.scenario.kind == ScenarioKind::POWER_RESTORE;
     if (outage || power) {
         const double limit = power ? 3.0 : 2.0;
-        for (const char* name : {"register", "tunnel"}) {
+        // Tunnels stay up and aliases stay mapped: those series have no
+        // steady rate to hold a peak against; the control server has.
+        for (const char* name : {"register"}) {
             const SeriesFigures& f = r.Series(name);
             if (f.steady > 0 && f.peak > limit * f.steady) {
                 snprintf(buf, sizeof buf, "%s: %s peak %.1f/s is %.2f x steady (goal <= %.0f x)",
@@ -695,7 +751,8 @@ std::vector<std::string> CheckGoals(const Result& r) {
     }
     for (const SeriesFigures& f : r.series) {
         if (f.lockStep || f.busiestRatio > 3.0) {
-            snprintf(buf, sizeof buf, "%s: %s in lock-step (busiest second %.2f x its minute's mean)",
+            snprintf(buf, sizeof buf,
+                     "%s: %s in lock-step (a second above 3 x its minute's mean; busiest %.2f x)",
                      r.scenario.name.c_str(), f.name.c_str(), f.busiestRatio);
             failed.push_back(buf);
         }

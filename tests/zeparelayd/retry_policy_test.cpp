@@ -11,7 +11,10 @@
 using namespace ZEPA::Relay;
 using zeparelayd::AliasPolicy;
 using zeparelayd::AliasStep;
+using zeparelayd::BackoffRule;
+using zeparelayd::JitterKind;
 using zeparelayd::RegistrationPolicy;
+using zeparelayd::RegistrationRules;
 
 using zepatest::FakeClock;
 using zepatest::FixedRandom;
@@ -25,56 +28,70 @@ protected:
     RegistrationPolicy policy{clock, jitter.Source()};
 };
 
-TEST_F(RegistrationPolicyTest, FailuresWaitThirtySecondsDoublingUpToThirtyMinutes) {
-    const std::vector<int64_t> expected = {30000, 60000, 120000, 240000, 480000, 960000, 1800000, 1800000};
-    for (size_t i = 0; i < expected.size(); ++i) {
-        EXPECT_EQ(expected[i], policy.OnFailure(RELAYD_ERR_NETWORK)) << "failure " << i + 1;
-        EXPECT_EQ(static_cast<int>(i + 1), policy.Failures());
+TEST_F(RegistrationPolicyTest, FailuresRetryAboutFiveMinutesAfterTheAttemptStarted) {
+    for (int i = 1; i <= 8; ++i) {
+        policy.OnAttempt();
+        clock.Advance(50);
+        // The wait does not grow: a long outage is left as soon as the relay is back.
+        EXPECT_EQ(285000 - 50, policy.OnFailure(RELAYD_ERR_NETWORK)) << "failure " << i;
+        EXPECT_EQ(i, policy.Failures());
+        clock.Advance(285000);
     }
     EXPECT_FALSE(policy.Halted());
 }
 
-TEST_F(RegistrationPolicyTest, JitterAddsUpToAQuarterOfTheWait) {
-    jitter.value = 7500;  // a quarter of 30 s: the most jitter there is
-    EXPECT_EQ(37500, policy.BackoffMs(1));
-    jitter.value = 7501;  // one more wraps round to no jitter
-    EXPECT_EQ(30000, policy.BackoffMs(1));
+TEST_F(RegistrationPolicyTest, AnAttemptThatHungDoesNotDelayTheNext) {
+    policy.OnAttempt();
+    clock.Advance(90000);  // the request's time-out
+    EXPECT_EQ(195000, policy.OnFailure(RELAYD_ERR_NETWORK));
+    EXPECT_EQ(195000, policy.RemainingMs());
+    // An attempt that took longer than the wait is followed at once.
+    policy.OnAttempt();
+    clock.Advance(400000);
+    EXPECT_EQ(0, policy.OnFailure(RELAYD_ERR_NETWORK));
+}
+
+TEST_F(RegistrationPolicyTest, JitterAddsUpToFifteenSeconds) {
+    jitter.value = 14250;  // 5 % of 285 s: the most jitter there is
+    EXPECT_EQ(299250, policy.BackoffMs(1));
+    jitter.value = 14251;  // one more wraps round to no jitter
+    EXPECT_EQ(285000, policy.BackoffMs(1));
     jitter.value = LONG_MIN;  // any value a source gives stays within the bounds
-    EXPECT_GE(policy.BackoffMs(7), 1800000);
-    EXPECT_LE(policy.BackoffMs(7), 1800000 + 450000);
+    EXPECT_GE(policy.BackoffMs(7), 285000);
+    EXPECT_LE(policy.BackoffMs(7), 299250);
 
     // The daemon's own source spreads over the whole range, never outside it.
     RegistrationPolicy real(clock, [] { return random(); });
     int64_t lowest = LLONG_MAX, highest = 0;
     for (int i = 0; i < 2000; ++i) {
         const int64_t delay = real.BackoffMs(2);
-        ASSERT_GE(delay, 60000);
-        ASSERT_LE(delay, 75000);
+        ASSERT_GE(delay, 285000);
+        ASSERT_LE(delay, 299250);
         lowest = std::min(lowest, delay);
         highest = std::max(highest, delay);
     }
-    EXPECT_LT(lowest, 61000);
-    EXPECT_GT(highest, 74000);
+    EXPECT_LT(lowest, 286000);
+    EXPECT_GT(highest, 298250);
 }
 
 TEST_F(RegistrationPolicyTest, TheWaitRunsOutOnTheClock) {
     EXPECT_EQ(-1, policy.RemainingMs());
-    ASSERT_EQ(30000, policy.OnFailure(RELAYD_ERR_SERVER_BUSY));
-    EXPECT_EQ(30000, policy.RemainingMs());
+    policy.OnAttempt();
+    ASSERT_EQ(285000, policy.OnFailure(RELAYD_ERR_SERVER_BUSY));
+    EXPECT_EQ(285000, policy.RemainingMs());
     clock.Advance(12000);
-    EXPECT_EQ(18000, policy.RemainingMs());
-    clock.Advance(40000);
+    EXPECT_EQ(273000, policy.RemainingMs());
+    clock.Advance(400000);
     EXPECT_EQ(0, policy.RemainingMs());
     policy.OnAttempt();
     EXPECT_EQ(-1, policy.RemainingMs());
 }
 
-TEST_F(RegistrationPolicyTest, NameResolutionFailureRetriesAfterTenSeconds) {
-    policy.OnFailure(RELAYD_ERR_NETWORK);
-    for (int i = 0; i < 5; ++i) EXPECT_EQ(10000, policy.OnFailure(RELAYD_ERR_RESOLV));
-    EXPECT_EQ(10000, policy.RemainingMs());
-    // Resolve failures do not lengthen the ordinary backoff.
-    EXPECT_EQ(60000, policy.OnFailure(RELAYD_ERR_NETWORK));
+TEST_F(RegistrationPolicyTest, ANameResolutionFailureCountsAsAFailure) {
+    policy.OnAttempt();
+    EXPECT_EQ(285000, policy.OnFailure(RELAYD_ERR_RESOLV));
+    EXPECT_EQ(1, policy.Failures());
+    EXPECT_EQ(285000, policy.RemainingMs());
 }
 
 TEST_F(RegistrationPolicyTest, FailuresOnlyAReloadCuresWaitForIt) {
@@ -89,30 +106,42 @@ TEST_F(RegistrationPolicyTest, FailuresOnlyAReloadCuresWaitForIt) {
     policy.Reset();
     EXPECT_FALSE(policy.Halted());
     EXPECT_EQ(0, policy.Failures());
-    EXPECT_EQ(30000, policy.OnFailure(RELAYD_ERR_UNKNOWN));
+    policy.OnAttempt();
+    EXPECT_EQ(285000, policy.OnFailure(RELAYD_ERR_UNKNOWN));
 }
 
 TEST_F(RegistrationPolicyTest, ARunOfServerMovesBacksOffAfterTheFirst) {
     EXPECT_EQ(0, policy.OnServerMoved());
-    EXPECT_EQ(30000, policy.OnServerMoved());
-    EXPECT_EQ(60000, policy.OnServerMoved());
+    EXPECT_EQ(285000, policy.OnServerMoved());
+    EXPECT_EQ(285000, policy.OnServerMoved());
     EXPECT_EQ(3, policy.Moves());
-    for (int i = 0; i < 20; ++i) policy.OnServerMoved();
-    EXPECT_EQ(1800000, policy.OnServerMoved());
-    EXPECT_EQ(1800000, policy.RemainingMs());
+    EXPECT_EQ(285000, policy.RemainingMs());
     // A success ends the run: the next move is followed at once again.
     policy.OnSuccess();
     EXPECT_EQ(0, policy.Moves());
     EXPECT_EQ(0, policy.OnServerMoved());
 }
 
-TEST_F(RegistrationPolicyTest, SuccessStartsTheBackoffAfresh) {
+TEST_F(RegistrationPolicyTest, TheFirstRegistrationWaitsUpToThreeMinutes) {
+    jitter.value = 0;
+    EXPECT_EQ(0, policy.OnStart());
+    jitter.value = 180000;
+    EXPECT_EQ(180000, policy.OnStart());
+    EXPECT_EQ(180000, policy.RemainingMs());
+    jitter.value = 180001;
+    EXPECT_EQ(0, policy.OnStart());
+    jitter.value = 77777;
+    EXPECT_EQ(77777, policy.OnStart());
+}
+
+TEST_F(RegistrationPolicyTest, SuccessStartsTheCountsAfresh) {
     policy.OnFailure(RELAYD_ERR_NETWORK);
     policy.OnFailure(RELAYD_ERR_NETWORK);
+    policy.OnServerMoved();
     policy.OnSuccess();
     EXPECT_EQ(0, policy.Failures());
+    EXPECT_EQ(0, policy.Moves());
     EXPECT_EQ(-1, policy.RemainingMs());
-    EXPECT_EQ(30000, policy.OnFailure(RELAYD_ERR_NETWORK));
 }
 
 TEST_F(RegistrationPolicyTest, DumpShowsTheBookkeeping) {
@@ -125,6 +154,61 @@ TEST_F(RegistrationPolicyTest, DumpShowsTheBookkeeping) {
     EXPECT_EQ(1, dump["moves"].asInt());
     EXPECT_FALSE(dump["halted"].asBool());
     EXPECT_EQ(0, dump["retry_in_ms"].asInt64());
+}
+
+// The rule variants the fleet simulator compares, one wait each.
+TEST(BackoffRuleTest, EachJitterKindStaysInItsRange) {
+    FixedRandom jitter;
+    const zeparelayd::RandomSource source = jitter.Source();
+    const BackoffRule added{30000, 1800000, JitterKind::ADDED, 25};
+    jitter.value = 0;
+    EXPECT_EQ(30000, added.WaitMs(1, 0, source));
+    EXPECT_EQ(1800000, added.WaitMs(8, 0, source));
+    jitter.value = 7500;
+    EXPECT_EQ(37500, added.WaitMs(1, 0, source));
+
+    const BackoffRule full{120000, 300000, JitterKind::FULL, 0};
+    jitter.value = 0;
+    EXPECT_EQ(0, full.WaitMs(1, 0, source));
+    jitter.value = 120000;
+    EXPECT_EQ(120000, full.WaitMs(1, 0, source));
+    jitter.value = 240000;
+    EXPECT_EQ(240000, full.WaitMs(2, 0, source));
+    jitter.value = 300000;
+    EXPECT_EQ(300000, full.WaitMs(5, 0, source));
+
+    const BackoffRule equal{240000, 240000, JitterKind::EQUAL, 0};
+    jitter.value = 0;
+    EXPECT_EQ(120000, equal.WaitMs(3, 0, source));
+    jitter.value = 120000;
+    EXPECT_EQ(240000, equal.WaitMs(3, 0, source));
+
+    const BackoffRule decorrelated{30000, 300000, JitterKind::DECORRELATED, 0};
+    jitter.value = 0;
+    EXPECT_EQ(30000, decorrelated.WaitMs(1, 0, source));
+    jitter.value = 60000;  // up to three times the previous wait
+    EXPECT_EQ(90000, decorrelated.WaitMs(2, 30000, source));
+    jitter.value = 270000;  // never above the cap
+    EXPECT_EQ(300000, decorrelated.WaitMs(5, 200000, source));
+}
+
+TEST(BackoffRuleTest, TheRulesBeforeTheFleetWasMeasuredStillRun) {
+    FakeClock clock;
+    FixedRandom jitter;
+    RegistrationRules before;
+    before.failure = {30000, 1800000, JitterKind::ADDED, 25};
+    before.resolveBacksOff = false;
+    before.fromAttemptStart = false;
+    before.startSpreadMs = 0;
+    RegistrationPolicy policy(clock, jitter.Source(), before);
+    const std::vector<int64_t> expected = {30000, 60000, 120000, 240000, 480000, 960000, 1800000, 1800000};
+    for (size_t i = 0; i < expected.size(); ++i) {
+        policy.OnAttempt();
+        clock.Advance(90000);
+        EXPECT_EQ(expected[i], policy.OnFailure(RELAYD_ERR_NETWORK)) << "failure " << i + 1;
+    }
+    EXPECT_EQ(10000, policy.OnFailure(RELAYD_ERR_RESOLV));
+    EXPECT_EQ(0, policy.OnStart());
 }
 
 class AliasPolicyTest : public ::testing::Test {

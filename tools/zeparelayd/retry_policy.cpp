@@ -50,13 +50,20 @@ int64_t Deadline::RemainingMs() const {
 // ---- registration ------------------------------------------------------------
 
 RegistrationPolicy::RegistrationPolicy(const Clock& clock, RandomSource random, RegistrationRules rules)
-    : _random(std::move(random)),
+    : _clock(clock),
+      _random(std::move(random)),
       _rules(rules),
       _due(clock),
+      _attemptMs(-1),
       _failures(0),
       _moves(0),
       _halted(false),
       _lastBackoffMs(0) {}
+
+void RegistrationPolicy::OnAttempt() {
+    _due.Clear();
+    _attemptMs = _clock.NowMs();
+}
 
 int64_t RegistrationPolicy::OnStart() { return Arm(Jitter(_random, _rules.startSpreadMs)); }
 
@@ -80,9 +87,14 @@ int64_t RegistrationPolicy::OnFailure(RELAYD_RET err) {
         _due.Clear();
         return WAIT_FOR_RELOAD;
     }
-    if (err == RELAYD_ERR_RESOLV) return Arm(_rules.resolveMs + Jitter(_random, _rules.resolveJitterMs));
+    if (err == RELAYD_ERR_RESOLV && !_rules.resolveBacksOff) {
+        return Arm(_rules.resolveMs + Jitter(_random, _rules.resolveJitterMs));
+    }
     ++_failures;
     _lastBackoffMs = BackoffMs(_failures);
+    if (_rules.fromAttemptStart && _attemptMs >= 0) {
+        return Arm(std::max<int64_t>(_attemptMs + _lastBackoffMs - _clock.NowMs(), 0));
+    }
     return Arm(_lastBackoffMs);
 }
 

@@ -39,13 +39,19 @@ struct BackoffRule {
 };
 
 // The registration's rules; the daemon runs on the defaults, the fleet
-// simulator also on variants of them.
+// simulator (bench/fleet) also on variants of them. The defaults are sized
+// for a control server that asks for a heartbeat every 5 minutes: a failing
+// appliance asks about as often as a registered one does.
 struct RegistrationRules {
-    BackoffRule failure{30000, 1800000, JitterKind::ADDED, 25};
+    BackoffRule failure{285000, 285000, JitterKind::ADDED, 5};
     int64_t resolveMs = 10000;    // after a failed name lookup ...
-    int64_t resolveJitterMs = 0;  // ... plus up to this much
-    int64_t moveSpreadMs = 0;     // first move: up to this much (0: at once)
-    int64_t startSpreadMs = 0;    // first registration after start: up to this much
+    int64_t resolveJitterMs = 0;  // ... plus up to this much;
+    bool resolveBacksOff = true;  // or: a failed lookup counts as a failure
+    // A failure's wait counts from the start of the failed attempt, not from
+    // its end: an attempt that hung until its time-out does not delay the next.
+    bool fromAttemptStart = true;
+    int64_t moveSpreadMs = 0;        // first move: up to this much (0: at once)
+    int64_t startSpreadMs = 180000;  // first registration after start: up to this much
 };
 
 struct TunnelRules {
@@ -67,12 +73,18 @@ private:
 };
 
 // Registration with the control server:
-//   - a failure waits 30 s, doubling per consecutive failure up to 30 min,
-//     plus up to a quarter of the wait as jitter, so that many appliances do
-//     not retry in step;
-//   - a name-resolution failure retries after 10 s (with a fresh DNS cache);
+//   - a failure is tried again 285 to 300 s after the failed attempt started,
+//     however long it hung and however long the relay has been away: about
+//     one attempt per heartbeat period, so an outage costs the relay no more
+//     than its steady load, every appliance is back within 5 minutes of the
+//     relay's return, and the jitter keeps appliances that failed together
+//     from staying in step;
+//   - a failed name lookup counts as such a failure (the cycle also empties
+//     the DNS cache): a resolver outage must not make the fleet ask more often;
 //   - failures that only a changed configuration or account can cure (auth,
 //     not supported, expired key, bad configuration) wait for a reload;
+//   - the first registration after start waits a random 0 to 3 minutes
+//     (OnStart), so that a fleet powered on together is spread out;
 //   - "server changed" with a new host: the first move is followed at once;
 //     a run of moves without a success backs off like failures do, so a
 //     server that keeps sending the daemon elsewhere cannot make it loop.
@@ -88,7 +100,7 @@ public:
     int64_t OnStart();
 
     // An attempt starts now: nothing is due any more.
-    void OnAttempt() { _due.Clear(); }
+    void OnAttempt();
     // After a failed attempt: the wait before the next one, or WAIT_FOR_RELOAD.
     int64_t OnFailure(ZEPA::Relay::RELAYD_RET err);
     // The control server named a new host: the wait before registering there.
@@ -104,15 +116,18 @@ public:
     void Dump(Json::Value& out) const;
 
     static bool NeedsReload(ZEPA::Relay::RELAYD_RET err);
-    // The doubling wait for the n-th consecutive failure (n >= 1), with jitter.
+    // The wait for the n-th consecutive failure (n >= 1), with jitter,
+    // counted from when the failed attempt started.
     int64_t BackoffMs(int n) const;
 
 private:
     int64_t Arm(int64_t delayMs);
 
+    const Clock& _clock;
     RandomSource _random;
     RegistrationRules _rules;
     Deadline _due;
+    int64_t _attemptMs;  // when the last attempt started, -1 before any
     int _failures;
     int _moves;
     bool _halted;
@@ -186,6 +201,9 @@ private:
 // (which also fetches fresh credentials) after 2 s doubling per consecutive
 // failure up to 5 min, plus up to a quarter of the wait as jitter. A tunnel
 // that comes up, or an answer without a tunnel, starts the count afresh.
+// (A relay outage closes every tunnel within the same few seconds, so these
+// re-registrations arrive close together; spreading the first one over two
+// minutes would smooth that, at the price of a slower single reconnection.)
 class TunnelPolicy {
 public:
     TunnelPolicy(const Clock& clock, RandomSource random, TunnelRules rules = TunnelRules());
