@@ -234,7 +234,7 @@ int main(int argc, char** argv) {
     }
 
     if (variants) {
-        printf("\nTrade-off (N = %d): worst over the outages (5 min, 1 h, 6 h; refused and hanging)\n",
+        printf("\nTrade-off (N = %d): worst over the outages (1 min, 5 min, 1 h, 6 h; refused and hanging)\n",
                config.appliances);
         printf(
             "(peaks: control server, highest 60-s mean / steady; lock-step: scenarios with a kind in it)\n");
