@@ -109,7 +109,7 @@ else
   # An index that is being synced on the mirror fails its size or hash check;
   # retry, then go on with the indexes that did arrive and say which did not.
   index_errors=
-  for wait in 0 10 30; do
+  for wait in 0 5 10; do
     sleep "$wait"
     if apt-get "${aptopt[@]}" update -q >"$aptdir/update.log" 2>&1; then index_errors=; break; fi
     index_errors=$(grep -E '^(E|W):' "$aptdir/update.log" || true)
