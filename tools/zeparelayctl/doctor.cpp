@@ -509,10 +509,12 @@ private:
                 detail += "; the certificate has expired";
                 hint = "the server's certificate has expired (or this clock is wrong: see clock)";
             }
-            Add(name + ".tls", v, detail, hint, t);
+            // One exchange carries TLS and HTTP: each gets its own share.
+            Add(name + ".tls", v, detail, hint, t).timeMs = std::max(0L, p.tlsMs);
         }
 
         if (p.failedAt == HttpProbe::HTTP) {
+            t += std::max(0L, p.tlsMs);
             Add(name + ".http", Verdict::FAIL,
                 "GET " + url + ": " + (p.timedOut ? "no answer" + timeout : Printable(p.error)),
                 p.timedOut ? "the server accepted the request but never answered: it hangs"
@@ -530,6 +532,7 @@ private:
         } else {
             Add(name + ".http", Verdict::OK, detail, "", t);
         }
+        if (facts.https && p.tlsMs >= 0) _report.checks.back().timeMs = std::max(0L, p.totalMs - p.tlsMs);
     }
 
     void NoteDate(const HttpProbe& p) {

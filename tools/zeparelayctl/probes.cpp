@@ -202,7 +202,10 @@ Lookup LookUp(const std::string& host, int timeoutMs) {
     if (err == EAI_INPROGRESS && gai_cancel(&p->request) != EAI_CANCELED) {
         result.timedOut = true;
         result.error = "no answer within " + std::to_string(timeoutMs) + " ms";
-        return result;  // p stays with the resolver thread
+        // The resolver thread still writes into it: kept, and kept reachable.
+        static std::vector<Pending*> abandoned;
+        abandoned.push_back(p);
+        return result;
     }
     if (err == EAI_INPROGRESS || err == EAI_CANCELED) {
         result.timedOut = true;
