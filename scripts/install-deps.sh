@@ -9,7 +9,7 @@ PACKAGES=(
   libgtest-dev libgmock-dev libbenchmark-dev
   python3 openssl ca-certificates procps iproute2 clang-format clang-tidy
   libsystemd-dev systemd dpkg-dev file lintian
-  openvpn
+  openvpn strace valgrind
   python3-matplotlib
 )
 

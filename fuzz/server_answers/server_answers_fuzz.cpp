@@ -34,6 +34,12 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     Check(AliasRequest::ParseCURLHttp(response, aliasRet, body, status), "an HTTP 200 answer is taken");
     std::string trimmed = text;
     Check(body == AliasRequest::Trim(trimmed), "the body is handed on trimmed");
+    // Any int as the libcurl code, as callers of the public struct may pass.
+    int code = 0;
+    for (size_t i = 0; i < size && i < sizeof(code); ++i)
+        code = static_cast<int>((static_cast<unsigned>(code) << 8) | data[i]);
+    HTTPResponse failed(-1, text, code);
+    AliasRequest::ParseCURLHttp(failed, aliasRet, body, status);
     ALIAS_RET classified = ALIAS_RET_UNKNOWN;
     if (AliasRequest::ParseServerResponse(text, classified)) {
         ALIAS_RETRY_TYPE retry;

@@ -79,6 +79,15 @@ public:
     static int Status(bool debug);
     // SIGRTMIN+1 to the status file's pid: 0 delivered, 1 not running, 255 broken.
     static int UpdateAlias();
+
+    // Whether pid, read from the status or PID file at path, is the live
+    // process that wrote it: 0 alive and started no later than the file was
+    // last written (2 s allowed for the boot clock's coarseness); 1 no file,
+    // no such process or one we may not signal, or a process started after
+    // the file (its pid recycled); 255 a pid of 0 or below, or a file that
+    // cannot be trusted: not a regular file (a link), a second hard link,
+    // owned by neither root nor the caller, or writable by group or others.
+    static int ProbeFilePid(const std::string& path, int pid);
 };
 
 }  // namespace Relay

@@ -248,13 +248,48 @@ std::string FormatKvEntry(const std::string& key, const std::string& value) {
     return out + "\"";
 }
 
+namespace {
+
+// The temporary file of a write: a leftover of ours at the name is reused;
+// anything else (a link, FIFO, folder, another user's file, a file with a
+// second name) is removed and the name created exclusively.
+int OpenKvTemporary(const std::string& tmp) {
+    int fd = open(tmp.c_str(), O_WRONLY | O_CREAT | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC | O_NOCTTY, 0600);
+    if (fd >= 0) {
+        struct stat st;
+        if (fstat(fd, &st) == 0 && S_ISREG(st.st_mode) && st.st_uid == geteuid() && st.st_nlink == 1 &&
+            ftruncate(fd, 0) == 0) {
+            int flags = fcntl(fd, F_GETFL);
+            if (flags != -1) fcntl(fd, F_SETFL, flags & ~O_NONBLOCK);
+            return fd;
+        }
+        close(fd);
+    } else if (errno == ENOENT || errno == ENOTDIR) {
+        return -1;
+    }
+    if (unlink(tmp.c_str()) != 0 && errno == EISDIR) rmdir(tmp.c_str());
+    return open(tmp.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC | O_NOCTTY, 0600);
+}
+
+// fsync of the folder holding path, so that the rename into it is durable.
+void SyncFolderOf(const std::string& path) {
+    const std::string::size_type slash = path.rfind('/');
+    const std::string folder = slash == std::string::npos ? "." : (slash == 0 ? "/" : path.substr(0, slash));
+    int fd = open(folder.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+    if (fd < 0) return;
+    fsync(fd);
+    close(fd);
+}
+
+}  // namespace
+
 bool WriteKvFile(const std::string& path, const std::vector<KvLine>& lines) {
     mode_t mode = 0644;
     struct stat st;
     if (stat(path.c_str(), &st) == 0) mode = st.st_mode & 07777;
 
     std::string tmp = path + ".tmp." + std::to_string(getpid());
-    int fd = open(tmp.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0600);
+    int fd = OpenKvTemporary(tmp);
     if (fd < 0) return false;
     std::string content;
     for (const KvLine& l : lines) content += l.text + "\n";
@@ -262,14 +297,19 @@ bool WriteKvFile(const std::string& path, const std::vector<KvLine>& lines) {
     size_t done = 0;
     while (ok && done < content.size()) {
         ssize_t n = write(fd, content.data() + done, content.size() - done);
+        if (n < 0 && errno == EINTR) continue;
         if (n <= 0)
             ok = false;
         else
             done += static_cast<size_t>(n);
     }
+    // The data reaches the disk before the name does: a power loss leaves
+    // the old settings or the new ones, never an empty file.
+    if (ok && fsync(fd) != 0) ok = false;
     if (ok && fchmod(fd, mode) != 0) ok = false;
     if (close(fd) != 0) ok = false;
     if (ok && rename(tmp.c_str(), path.c_str()) != 0) ok = false;
+    if (ok) SyncFolderOf(path);
     if (!ok) unlink(tmp.c_str());
     ForgetKvFile(path);
     return ok;

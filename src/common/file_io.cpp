@@ -3,21 +3,17 @@
 #include <dirent.h>
 #include <fcntl.h>
 #include <json/reader.h>
-#include <libdaemon/dpid.h>
-#include <sys/random.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
 #include <cerrno>
 #include <csignal>
-#include <cstdint>
+#include <cstdio>
 #include <cstring>
 #include <ctime>
 #include <exception>
 #include <memory>
 #include <new>
-
-#include "common/paths.h"
 
 namespace ZEPA {
 namespace Relay {
@@ -26,28 +22,8 @@ namespace FileIo {
 namespace {
 
 const char TMP_INFIX[] = ".tmp.";
-const size_t RANDOM_CHARS = 8;
-const char ALPHABET[] = "abcdefghijklmnopqrstuvwxyzABCDEFGHIJKLMNOPQRSTUVWXYZ0123456789";
-const char DAEMON_NAME[] = "zeparelayd";
-// The kernel keeps 15 characters of a command name.
-const size_t COMM_CHARS = 15;
-
-std::string RandomSuffix() {
-    unsigned char bytes[RANDOM_CHARS];
-    if (getrandom(bytes, sizeof(bytes), GRND_NONBLOCK) != static_cast<ssize_t>(sizeof(bytes))) {
-        // Unpredictability is a bonus: the exclusive create is what keeps us safe.
-        // 64 bits on every target: the generator's constants and shift need them.
-        uint64_t mix = static_cast<uint64_t>(time(nullptr)) ^ (static_cast<uint64_t>(getpid()) << 16) ^
-                       static_cast<uint64_t>(clock());
-        for (unsigned char& b : bytes) {
-            mix = mix * 6364136223846793005ULL + 1442695040888963407ULL;
-            b = static_cast<unsigned char>(mix >> 33);
-        }
-    }
-    std::string out;
-    for (unsigned char b : bytes) out += ALPHABET[b % (sizeof(ALPHABET) - 1)];
-    return out;
-}
+// Deepest folder tree removed from a name that we need.
+const int MAX_TREE_DEPTH = 64;
 
 bool AllDigits(const std::string& s) {
     if (s.empty()) return false;
@@ -56,26 +32,35 @@ bool AllDigits(const std::string& s) {
     return true;
 }
 
-bool AllAlnum(const std::string& s) {
-    for (char c : s)
-        if (strchr(ALPHABET, c) == nullptr || c == '\0') return false;
-    return true;
-}
-
-// The pid of a temporary-file name of base: "<base>.tmp.<pid>" or
-// "<base>.tmp.<pid>.<random>"; 0 when the name is not of that pattern.
+// The pid of a temporary-file name of base, "<base>.tmp.<pid>"; 0 when the
+// name is not of that pattern.
 pid_t TemporaryPid(const std::string& name, const std::string& base) {
     const std::string prefix = base + TMP_INFIX;
     if (name.compare(0, prefix.size(), prefix) != 0) return 0;
-    std::string rest = name.substr(prefix.size());
-    std::string::size_type dot = rest.find('.');
-    if (dot != std::string::npos) {
-        std::string suffix = rest.substr(dot + 1);
-        if (suffix.size() != RANDOM_CHARS || !AllAlnum(suffix)) return 0;
-        rest = rest.substr(0, dot);
-    }
+    const std::string rest = name.substr(prefix.size());
     if (!AllDigits(rest) || rest.size() > 9) return 0;
     return static_cast<pid_t>(atol(rest.c_str()));
+}
+
+// Removes name in the folder dirFd without following links; a folder with
+// everything in it. Depth is bounded: each level holds a descriptor.
+bool RemoveAt(int dirFd, const char* name, int depth) {
+    if (unlinkat(dirFd, name, 0) == 0) return true;
+    if (errno != EISDIR && errno != EPERM) return false;
+    if (depth >= MAX_TREE_DEPTH) return false;
+    int fd = openat(dirFd, name, O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC | O_NONBLOCK);
+    if (fd < 0) return false;
+    DIR* dir = fdopendir(fd);
+    if (dir == nullptr) {
+        close(fd);
+        return false;
+    }
+    for (dirent* e = readdir(dir); e != nullptr; e = readdir(dir)) {
+        if (strcmp(e->d_name, ".") == 0 || strcmp(e->d_name, "..") == 0) continue;
+        RemoveAt(dirfd(dir), e->d_name, depth + 1);
+    }
+    closedir(dir);
+    return unlinkat(dirFd, name, AT_REMOVEDIR) == 0;
 }
 
 void SplitPath(const std::string& path, std::string& folder, std::string& base) {
@@ -87,12 +72,6 @@ void SplitPath(const std::string& path, std::string& folder, std::string& base) 
         folder = slash == 0 ? "/" : path.substr(0, slash);
         base = path.substr(slash + 1);
     }
-}
-
-std::string ReadSmall(const std::string& path) {
-    std::string text;
-    ReadRegular(path, 256, text);  // /proc files are regular
-    return text;
 }
 
 }  // namespace
@@ -154,15 +133,60 @@ std::string ClipForLog(const std::string& text) {
     return text.substr(0, MAX_LOGGED_BODY) + "... (" + std::to_string(text.size()) + " bytes)";
 }
 
-int CreateTemporary(const std::string& path, std::string& name) {
-    const std::string stem = path + TMP_INFIX + std::to_string(getpid()) + ".";
-    int fd = -1;
-    for (int attempt = 0; attempt < 100; ++attempt) {
-        name = stem + RandomSuffix();
-        fd = open(name.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC | O_NOCTTY, 0600);
-        if (fd >= 0 || errno != EEXIST) break;
+std::string TemporaryName(const std::string& path) { return path + TMP_INFIX + std::to_string(getpid()); }
+
+int OpenTemporary(const std::string& name, bool& removedForeign) {
+    removedForeign = false;
+    // Never through a link, never blocking on a FIFO, and nothing truncated
+    // before we know it is ours.
+    int fd = open(name.c_str(), O_WRONLY | O_CREAT | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC | O_NOCTTY, 0600);
+    if (fd >= 0) {
+        struct stat st;
+        if (fstat(fd, &st) == 0 && S_ISREG(st.st_mode) && st.st_uid == geteuid() && st.st_nlink == 1 &&
+            ftruncate(fd, 0) == 0) {
+            int flags = fcntl(fd, F_GETFL);
+            if (flags != -1) fcntl(fd, F_SETFL, flags & ~O_NONBLOCK);
+            return fd;
+        }
+        close(fd);
+    } else if (errno == ENOENT || errno == ENOTDIR) {
+        return -1;  // no folder to write in
     }
-    return fd;
+    // A link, FIFO, device, folder, another user's file or a second name of
+    // some file: not ours to write through. Gone, and the name made anew.
+    removedForeign = RemoveEntry(name, true);
+    return open(name.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC | O_NOCTTY, 0600);
+}
+
+bool RemoveEntry(const std::string& path, bool ownFolders) {
+    std::string folder, base;
+    SplitPath(path, folder, base);
+    if (base.empty() || base == "." || base == "..") return false;
+    int dirFd = open(folder.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+    if (dirFd < 0) return false;
+    struct stat st;
+    bool removed = fstatat(dirFd, base.c_str(), &st, AT_SYMLINK_NOFOLLOW) == 0 &&
+                   (ownFolders || !S_ISDIR(st.st_mode) || (st.st_uid != 0 && st.st_uid != geteuid())) &&
+                   RemoveAt(dirFd, base.c_str(), 0);
+    close(dirFd);
+    return removed;
+}
+
+int Publish(const std::string& tmp, const std::string& path, bool& removedForeign) {
+    removedForeign = false;
+    if (rename(tmp.c_str(), path.c_str()) == 0) return 0;
+    const int renameErrno = errno;
+    if (renameErrno != EISDIR && renameErrno != ENOTEMPTY && renameErrno != EEXIST) return renameErrno;
+    // A folder planted by another user holds the name: swap it out in one
+    // step, so that readers see it or the new file and nothing in between,
+    // then remove it. Our own folder there is a caller's mistake: kept.
+    struct stat st;
+    if (lstat(path.c_str(), &st) != 0 || !S_ISDIR(st.st_mode) || st.st_uid == 0 || st.st_uid == geteuid())
+        return renameErrno;
+    if (renameat2(AT_FDCWD, tmp.c_str(), AT_FDCWD, path.c_str(), RENAME_EXCHANGE) != 0) return renameErrno;
+    RemoveEntry(tmp, false);
+    removedForeign = true;
+    return 0;
 }
 
 bool WriteAll(int fd, const char* data, size_t size) {
@@ -205,27 +229,6 @@ void RemoveStaleTemporaries(const std::string& path) {
         if (dead || old) unlinkat(dirfd(dir), name.c_str(), 0);
     }
     closedir(dir);
-}
-
-bool IsDaemonProcess(pid_t pid) {
-    if (pid <= 0) return false;
-    if (kill(pid, 0) != 0 && errno != EPERM) return false;
-    const std::string name = daemon_pid_file_ident != nullptr ? daemon_pid_file_ident : DAEMON_NAME;
-    const std::string proc = std::string(Paths::PROC_DIR) + std::to_string(pid);
-    std::string comm = ReadSmall(proc + "/comm");
-    if (!comm.empty() && comm.back() == '\n') comm.pop_back();
-    if (!comm.empty() && comm == name.substr(0, COMM_CHARS)) return true;
-    // A command name changed at run time still leaves the executable's name.
-    char target[4096];
-    ssize_t n = readlink((proc + "/exe").c_str(), target, sizeof(target) - 1);
-    if (n <= 0) return false;
-    std::string exe(target, static_cast<size_t>(n));
-    const std::string deleted = " (deleted)";
-    if (exe.size() > deleted.size() && exe.compare(exe.size() - deleted.size(), deleted.size(), deleted) == 0)
-        exe.erase(exe.size() - deleted.size());
-    std::string folder, base;
-    SplitPath(exe, folder, base);
-    return base == name;
 }
 
 }  // namespace FileIo

@@ -1,7 +1,7 @@
 // Careful file access for everything the library reads from or writes to
 // places that other users may reach (/tmp above all): bounded reads that never
 // block on FIFOs or devices, JSON parsing that never throws, and temporary
-// files that cannot be planted in advance.
+// files that nothing planted in advance is written through.
 #ifndef ZEPARELAYD_SRC_COMMON_FILE_IO_H
 #define ZEPARELAYD_SRC_COMMON_FILE_IO_H
 
@@ -51,10 +51,28 @@ bool ParseJson(const std::string& text, Json::Value& out);
 // text cut to MAX_LOGGED_BODY bytes, with a note of the full length.
 std::string ClipForLog(const std::string& text);
 
-// Creates "<path>.tmp.<pid>.<random>" exclusively (O_CREAT|O_EXCL|O_NOFOLLOW,
-// mode 0600). Returns the descriptor, or -1 with errno set; name holds the
-// created (or last attempted) name.
-int CreateTemporary(const std::string& path, std::string& name);
+// The temporary name of a write to path: "<path>.tmp.<pid>".
+std::string TemporaryName(const std::string& path);
+
+// Opens the temporary name for writing. A regular file of this user with one
+// link found there is ours (a leftover of an earlier write): truncated and
+// used. Anything else there (a link, FIFO, device, folder, another user's
+// file, a file with a second link) is removed and the name created
+// exclusively (mode 0600); removedForeign tells that it happened. Returns the
+// descriptor, or -1 with errno set.
+int OpenTemporary(const std::string& name, bool& removedForeign);
+
+// Removes path without following links: a file, link, FIFO, device, or a
+// folder with everything below it. A folder of this user or root's is left
+// alone unless ownFolders: at a fixed name it is a caller's mistake, never a
+// plant. False when something was left.
+bool RemoveEntry(const std::string& path, bool ownFolders);
+
+// Renames tmp onto path. When another user's folder holds path, the two are
+// exchanged in one step and the folder removed afterwards (removedForeign
+// then true).
+// Returns 0, or the errno of the failed rename.
+int Publish(const std::string& tmp, const std::string& path, bool& removedForeign);
 
 // Writes the whole buffer, retrying short writes and interruptions.
 bool WriteAll(int fd, const char* data, size_t size);
@@ -66,11 +84,6 @@ bool SyncFolderOf(const std::string& path);
 // been at it longer than STALE_TEMPORARY_SECONDS). Only names of our own
 // pattern, only regular files owned by this user.
 void RemoveStaleTemporaries(const std::string& path);
-
-// True when pid > 0 names a live process whose command or executable name is
-// the daemon's (Daemon::SetName, "zeparelayd" by default). Stops the status
-// readers from trusting a pid that a planted or stale file names.
-bool IsDaemonProcess(pid_t pid);
 
 }  // namespace FileIo
 }  // namespace Relay

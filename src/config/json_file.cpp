@@ -7,6 +7,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <cerrno>
 #include <cstdio>
 #include <exception>
 #include <iostream>
@@ -79,33 +80,39 @@ bool RelaydConf::WriteJsonFile(const std::string& path, const Json::Value& value
         std::cout << text << std::flush;
         return true;
     }
-    // An empty target names no file: its temporary file is never created in
-    // whatever folder the process happens to run in.
-    std::string tmp = path + ".tmp." + std::to_string(getpid());
+    const std::string tmp = FileIo::TemporaryName(path);
     int fd = -1;
+    // An empty target names no file: nothing is created or removed in
+    // whatever folder the process happens to run in.
     if (!path.empty()) {
         FileIo::RemoveStaleTemporaries(path);
-        // Exclusive and unpredictable: nothing planted at the name is written through.
-        fd = FileIo::CreateTemporary(path, tmp);
+        bool removedForeign = false;
+        fd = FileIo::OpenTemporary(tmp, removedForeign);
+        if (removedForeign) ZLOG(ZEPA_LOG_WARNING, "removed what stood at %s", tmp.c_str());
     }
     if (fd < 0) {
         ZLOG(ZEPA_LOG_ERR, "open failed [%s]", tmp.c_str());
+        if (!path.empty()) unlink(tmp.c_str());
         return false;
     }
     // The data reaches the disk before the name does, so that a power loss
     // leaves the old file or the new one, never an empty one.
-    bool result = FileIo::WriteAll(fd, text.data(), text.size()) && fchmod(fd, 0644) == 0 && fsync(fd) == 0;
+    bool result = FileIo::WriteAll(fd, text.data(), text.size()) && fsync(fd) == 0 && fchmod(fd, 0644) == 0;
     if (close(fd) != 0) result = false;
     if (!result) {
         unlink(tmp.c_str());
         return false;
     }
-    if (rename(tmp.c_str(), path.c_str()) != 0) {
+    bool removedForeign = false;
+    const int renameErrno = FileIo::Publish(tmp, path, removedForeign);
+    if (renameErrno != 0) {
         // Logged, not reported: the old file is still whole.
+        errno = renameErrno;
         ZLOG(ZEPA_LOG_ERR, "rename to %s failed %m", path.c_str());
         unlink(tmp.c_str());
         return result;
     }
+    if (removedForeign) ZLOG(ZEPA_LOG_WARNING, "removed what stood at %s", path.c_str());
     FileIo::SyncFolderOf(path);
     return result;
 }

@@ -4,6 +4,7 @@
 
 #include <fcntl.h>
 #include <libdaemon/dlog.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -63,11 +64,24 @@ void Daemon::LogV(int level, const char* format, va_list args) {
 }
 
 bool Daemon::OpenLogFile(const std::string& path, int fd, int flags) {
-    int newFd = open(path.c_str(), flags | O_WRONLY, 0600);
+    // Never through a link, never blocking on a FIFO, and truncated only once
+    // it is known to be a plain file: a link or FIFO planted where the log
+    // lives must neither hang the daemon nor have root write (or empty) some
+    // other file.
+    const bool truncate = (flags & O_TRUNC) != 0;
+    int newFd = open(path.c_str(), (flags & ~O_TRUNC) | O_WRONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY, 0600);
+    struct stat st;
+    if (newFd >= 0 && (fstat(newFd, &st) != 0 || !S_ISREG(st.st_mode) || st.st_nlink != 1 ||
+                       (truncate && ftruncate(newFd, 0) != 0))) {
+        close(newFd);
+        newFd = -1;
+    }
     if (newFd < 0) {
         ZLOG(ZEPA_LOG_ERR, "open log file [%s] failed", path.c_str());
         return false;
     }
+    const int status = fcntl(newFd, F_GETFL);
+    if (status != -1) fcntl(newFd, F_SETFL, status & ~O_NONBLOCK);
     if (newFd == fd) return true;
     bool ok = true;
     if (dup2(newFd, fd) < 0) {

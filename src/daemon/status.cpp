@@ -2,8 +2,10 @@
 // system log, never to the library log.
 #define ZEPA_LOG_SOURCE "daemon"
 
+#include <fcntl.h>
 #include <libdaemon/dpid.h>
 #include <sys/file.h>
+#include <sys/stat.h>
 #include <syslog.h>
 #include <unistd.h>
 
@@ -70,6 +72,21 @@ int ReadDebugDump(const std::string& path, Json::Value& out) {
     }
 }
 
+// The debug file is created by the query. Whatever else stands at its name
+// (a link, FIFO, folder or file that another user planted) would keep every
+// query from an answer: it is removed, and the name created exclusively. A
+// file of ours or root's is another query's, or a leftover, and is left to
+// the lock.
+void ClaimDebugFile(const std::string& path) {
+    struct stat st;
+    if (lstat(path.c_str(), &st) == 0) {
+        if (S_ISREG(st.st_mode) && st.st_nlink == 1 && (st.st_uid == 0 || st.st_uid == geteuid())) return;
+        if (FileIo::RemoveEntry(path, true)) ZSYSLOG(LOG_WARNING, "removed what stood at %s", path.c_str());
+    }
+    int fd = open(path.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC | O_NOCTTY, 0600);
+    if (fd >= 0) close(fd);
+}
+
 }  // namespace
 
 int LoadStatusFile(Json::Value& out, pid_t& pid) {
@@ -92,12 +109,18 @@ int LoadStatusFile(Json::Value& out, pid_t& pid) {
     return RELAYD_RESULT_OK;
 }
 
+int ProbeStatusWriter(pid_t pid) {
+    int probe = Daemon::ProbeFilePid(Daemon::GetStatusPath(), pid);
+    // Planted by another user, or writable by one: it names no daemon of ours.
+    if (probe == RELAYD_RESULT_BROKEN) ZSYSLOG(LOG_ERR, "bad zeparelayd status file");
+    return probe;
+}
+
 int Daemon::GetStatus(Json::Value& out) {
     pid_t pid = 0;
     int ret = LoadStatusFile(out, pid);
     if (ret != RELAYD_RESULT_OK) return ret;
-    // A stale file may name a pid that an unrelated process has since taken.
-    return FileIo::IsDaemonProcess(pid) ? RELAYD_RESULT_OK : RELAYD_RESULT_NOT_RUNNING;
+    return ProbeStatusWriter(pid);
 }
 
 bool Daemon::GetStatus(std::string& serverId, std::string& state, std::string& error, const char* serviceId) {
@@ -134,8 +157,12 @@ int Daemon::DebugStatus(Json::Value& out) {
         ZSYSLOG(LOG_ERR, "bad zeparelayd status pid");
         return RELAYD_RESULT_BROKEN;
     }
-    if (!FileIo::IsDaemonProcess(pid)) return RELAYD_RESULT_NOT_RUNNING;
+    // A PID file left by a crash may name a pid that another process has since taken.
+    int probe = ProbeFilePid(GetPidFile(), pid);
+    if (probe == RELAYD_RESULT_BROKEN) ZSYSLOG(LOG_ERR, "bad zeparelayd status pid");
+    if (probe != RELAYD_RESULT_OK) return probe;
     const std::string path = Daemon::GetDebugPath(pid);
+    ClaimDebugFile(path);
     FileLock lock(path.c_str());
     if (!lock.Lock(LOCK_EX)) {
         ZSYSLOG(LOG_INFO, "lock failed");

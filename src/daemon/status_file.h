@@ -13,6 +13,10 @@ namespace Relay {
 // to the system log) when the content or its pid is broken.
 int LoadStatusFile(Json::Value& out, pid_t& pid);
 
+// Daemon::ProbeFilePid on the status file; an untrusted file is reported to
+// the system log as a bad status file.
+int ProbeStatusWriter(pid_t pid);
+
 // Status(false): server id, state, alias and error lines on standard output.
 int PrintStatusReport();
 

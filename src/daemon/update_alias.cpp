@@ -5,7 +5,6 @@
 
 #include <zeparelayd/errors.h>
 
-#include "common/file_io.h"
 #include "common/log.h"
 #include "daemon/status_file.h"
 
@@ -17,8 +16,9 @@ int Daemon::UpdateAlias() {
     pid_t pid = 0;
     int ret = LoadStatusFile(status, pid);
     if (ret != RELAYD_RESULT_OK) return ret;
-    // The status file's pid is positive here; it must also be our daemon.
-    if (!FileIo::IsDaemonProcess(pid)) return RELAYD_RESULT_NOT_RUNNING;
+    // The status file's pid is positive here; it must also be its writer.
+    ret = ProbeStatusWriter(pid);
+    if (ret != RELAYD_RESULT_OK) return ret;
     // SIGRTMIN is a run-time value on Linux, never a constant.
     return kill(pid, SIGRTMIN + 1) == 0 ? RELAYD_RESULT_OK : RELAYD_RESULT_NOT_RUNNING;
 }

@@ -37,6 +37,14 @@ inline CurlFailure ClassifyCurlCode(int code) {
     }
 }
 
+// libcurl's text for a code kept as an int (HTTPResponse takes any int): a
+// number outside CURLcode never becomes one, and gets libcurl's own words for
+// a code it does not know.
+inline const char* CurlCodeText(int code) {
+    if (code < CURLE_OK || code >= CURL_LAST) return "Unknown error";
+    return curl_easy_strerror(static_cast<CURLcode>(code));
+}
+
 }  // namespace Relay
 }  // namespace ZEPA
 

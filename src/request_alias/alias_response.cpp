@@ -23,7 +23,7 @@ int g_lastLoggedCurlCode = 0;
 // Logs a failing code once per run of equal codes.
 void LogCurlError(int code) {
     if (code == g_lastLoggedCurlCode) return;
-    ZLOG(ZEPA_LOG_ERR, "curl error: %d, %s", code, curl_easy_strerror(static_cast<CURLcode>(code)));
+    ZLOG(ZEPA_LOG_ERR, "curl error: %d, %s", code, CurlCodeText(code));
     g_lastLoggedCurlCode = code;
 }
 

@@ -15,6 +15,7 @@
 
 #include <zeparelayd/tunnel.h>
 
+#include "common/file_io.h"
 #include "common/log.h"
 #include "common/paths.h"
 #include "common/seams.h"
@@ -155,18 +156,22 @@ bool Tunnel::RunVPNTunnel(const char* proto) {
 
 namespace {
 
-// A file of ours left by an earlier run (regular, one link, our owner) is
-// replaced; anything else standing at the name is refused with EEXIST.
+// Whatever stands at the name (our leftover of an earlier run, a link, a
+// FIFO, a folder, another user's file, a file with a second hard link) is
+// removed first, and the name is created exclusively: nothing planted is
+// ever written into, and nothing planted keeps the tunnel from starting.
 int CreatePassFile(const std::string& path) {
     const int flags = O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC | O_NOCTTY;
     int fd = g_tunnelFileOps.open(path.c_str(), flags, 0600);
     if (fd >= 0 || errno != EEXIST) return fd;
     struct stat st;
-    if (lstat(path.c_str(), &st) != 0 || !S_ISREG(st.st_mode) || st.st_uid != geteuid() || st.st_nlink != 1) {
+    const bool ours =
+        lstat(path.c_str(), &st) == 0 && S_ISREG(st.st_mode) && st.st_uid == geteuid() && st.st_nlink == 1;
+    if (!FileIo::RemoveEntry(path, true)) {
         errno = EEXIST;
         return -1;
     }
-    if (unlink(path.c_str()) != 0) return -1;
+    if (!ours) ZLOG(ZEPA_LOG_WARNING, "removed what stood at %s", path.c_str());
     return g_tunnelFileOps.open(path.c_str(), flags, 0600);
 }
 

@@ -123,7 +123,7 @@ TEST_F(ConfigFileTest, MissingFolderFailsAtTheTemporaryFile) {
     StderrCapture cap;
     EXPECT_FALSE(c.WriteConfigFile(target));
     std::string log = cap.stop();
-    EXPECT_TRUE(LogContains(log, "open failed [" + target + ".tmp." + std::to_string(getpid()) + ".")) << log;
+    EXPECT_TRUE(LogContains(log, "open failed [" + target + ".tmp." + std::to_string(getpid()) + "]")) << log;
 }
 
 // An empty name is no file: the write fails at its temporary file, and

@@ -134,7 +134,18 @@ TEST_F(JsonFileTest, WriteIntoMissingDirectoryFailsAtOpen) {
     StderrCapture cap;
     EXPECT_FALSE(RelaydConf::WriteJsonFile(path, Json::Value(1)));
     std::string log = cap.stop();
-    EXPECT_TRUE(LogContains(log, "open failed [" + path + ".tmp." + std::to_string(getpid()) + ".")) << log;
+    EXPECT_TRUE(LogContains(log, "open failed [" + path + ".tmp." + std::to_string(getpid()) + "]")) << log;
+}
+
+TEST_F(JsonFileTest, AStaleTemporaryOfThisWriterIsTruncatedAndRenamed) {
+    root.mkdir("/conf");
+    const std::string path = root.path("/conf/out.conf");
+    const std::string tmp = path + ".tmp." + std::to_string(getpid());
+    zepatest::WriteFile(tmp, std::string(5000, 'x'), 0600);
+    ASSERT_TRUE(RelaydConf::WriteJsonFile(path, ParseJson(R"({"k": 1})")));
+    EXPECT_EQ("{\n   \"k\" : 1\n}\n", ReadFile(path));
+    EXPECT_EQ(0644u, FileMode(path));
+    EXPECT_FALSE(FileExists(tmp));
 }
 
 TEST_F(JsonFileTest, EmptyPathFailsAtTheOpenEvenInAWritableFolder) {

@@ -118,8 +118,9 @@ StandInDaemon::StandInDaemon(DumpMode mode) {
     _pid = fork();
     if (_pid == 0) {
         close(fds[0]);
-        // The status readers believe only a process of the daemon's name.
-        prctl(PR_SET_NAME, "zeparelayd");
+        // A vendor build may name its daemon as it likes (Daemon::SetName):
+        // the readers must not go by the name.
+        prctl(PR_SET_NAME, "vendor-relay");
         int ready = 0;
         if (write(fds[1], &ready, sizeof(ready)) != sizeof(ready)) _exit(3);
         StandInLoop(mode, fds[1]);

@@ -13,6 +13,7 @@
 #include <csignal>
 #include <functional>
 #include <string>
+#include <vector>
 
 #include <zeparelayd/daemon.h>
 
@@ -117,15 +118,21 @@ TEST_F(HostileStatus, PidsThatNameProcessGroupsAreNeverSignalled) {
     }
 }
 
-TEST_F(HostileStatus, ALiveProcessThatIsNoDaemonIsNotRunningAndGetsNoSignal) {
-    // A plain child: alive, but not of the daemon's name.
+TEST_F(HostileStatus, APidRecycledAfterTheFileWasWrittenIsNotRunningAndGetsNoSignal) {
+    // The file was last written an hour ago; the process that holds its pid
+    // now started just now, so it cannot have written it.
     int release = -1;
     pid_t other = IdleChild(release);
     ASSERT_GT(other, 0);
     root.write(STATUS, "{\"pid\": " + std::to_string(other) + ", \"state\": 4}");
+    zepatest::SetAge(root.path(STATUS), 3600);
     Json::Value out;
     EXPECT_EQ(1, Daemon::GetStatus(out));
+    EXPECT_EQ(4, out["state"].asInt());
     EXPECT_EQ(1, Daemon::UpdateAlias());
+    std::string id, state, error;
+    EXPECT_TRUE(Daemon::GetStatus(id, state, error, nullptr));
+    EXPECT_EQ("not_running", state);
     // Had SIGRTMIN+1 reached it, its default action would have ended it.
     close(release);
     int status = Reap(other);
@@ -133,13 +140,66 @@ TEST_F(HostileStatus, ALiveProcessThatIsNoDaemonIsNotRunningAndGetsNoSignal) {
     EXPECT_EQ(0, WEXITSTATUS(status));
 }
 
-TEST_F(HostileStatus, ProcessOfTheDaemonsNameIsRunning) {
+TEST_F(HostileStatus, TheWriterIsRunningWhateverItsName) {
     StandInDaemon daemon;
     root.write(STATUS, "{\"pid\": " + std::to_string(daemon.pid()) + "}");
     Json::Value out;
     EXPECT_EQ(0, Daemon::GetStatus(out));
     EXPECT_EQ(0, Daemon::UpdateAlias());
     EXPECT_EQ(SIGRTMIN + 1, daemon.NextSignal());
+}
+
+TEST_F(HostileStatus, StatusFilesOthersCouldHaveWrittenAreBrokenAndSignalNobody) {
+    // A live process that any signal would end, named by files that another
+    // user could have planted or changed.
+    int release = -1;
+    pid_t other = IdleChild(release);
+    ASSERT_GT(other, 0);
+    const std::string content = "{\"pid\": " + std::to_string(other) + ", \"serverID\": \"abc\"}";
+    const std::string path = root.path(STATUS);
+    struct Case {
+        const char* what;
+        std::function<void()> plant;
+    };
+    const std::vector<Case> cases = {
+        {"group-writable", [&] { root.write(STATUS, content, 0664); }},
+        {"world-writable", [&] { root.write(STATUS, content, 0646); }},
+        {"link",
+         [&] {
+             root.write("/tmp/real-status", content);
+             ASSERT_EQ(0, symlink(root.path("/tmp/real-status").c_str(), path.c_str()));
+         }},
+        {"second hard link",
+         [&] {
+             root.write(STATUS, content);
+             ASSERT_EQ(0, link(path.c_str(), root.path("/tmp/other-name").c_str()));
+         }},
+    };
+    for (const Case& c : cases) {
+        SCOPED_TRACE(c.what);
+        unlink(path.c_str());
+        unlink(root.path("/tmp/other-name").c_str());
+        c.plant();
+        StartSyslogRecorder();
+        Json::Value out;
+        EXPECT_EQ(255, Daemon::GetStatus(out));
+        EXPECT_EQ(255, Daemon::UpdateAlias());
+        EXPECT_TRUE(SyslogHas(LOG_ERR, "bad zeparelayd status file"));
+        std::string id, state, error;
+        EXPECT_FALSE(Daemon::GetStatus(id, state, error, nullptr));
+    }
+    if (geteuid() == 0) {
+        // Another user's file, even one no one else may write.
+        root.write(STATUS, content);
+        ASSERT_EQ(0, chown(path.c_str(), 65534, 65534));
+        Json::Value out;
+        EXPECT_EQ(255, Daemon::GetStatus(out));
+        EXPECT_EQ(255, Daemon::UpdateAlias());
+    }
+    close(release);
+    int status = Reap(other);
+    ASSERT_TRUE(WIFEXITED(status));
+    EXPECT_EQ(0, WEXITSTATUS(status));
 }
 
 TEST_F(HostileStatus, PidFileNamingZeroSignalsNobody) {
@@ -153,16 +213,18 @@ TEST_F(HostileStatus, PidFileNamingZeroSignalsNobody) {
     EXPECT_EQ(2, InOwnGroup([] { return Daemon::LibInit() ? Daemon::Signal(SIGUSR1) : 3; }));
 }
 
-TEST_F(HostileStatus, PidFileNamingAnotherProgramGetsNoDebugSignal) {
+TEST_F(HostileStatus, PidFileNamingARecycledPidGetsNoDebugSignal) {
     int release = -1;
     pid_t other = IdleChild(release);
     ASSERT_GT(other, 0);
     WritePidFile(other);
+    zepatest::SetAge(DefaultPidFile(), 3600);
     Json::Value out;
     EXPECT_EQ(1, Daemon::DebugStatus(out));
     close(release);
     int status = Reap(other);
     ASSERT_TRUE(WIFEXITED(status));
+    EXPECT_EQ(0, WEXITSTATUS(status));
     EXPECT_FALSE(zepatest::FileExists(DebugFile(other)));
 }
 
@@ -196,6 +258,38 @@ TEST_F(HostileStatus, DebugFilesThatAreNoFilesNeverBlockTheQuery) {
             return Daemon::DebugStatus(out);
         });
         EXPECT_TRUE(code == 255 || code == 11) << code;
+        daemon.Stop();
+    }
+}
+
+TEST_F(HostileStatus, WhateverStandsAtTheDebugFileNameTheDaemonAnswers) {
+    std::vector<std::string> kinds = {"link", "fifo", "folder", "second-link"};
+    if (geteuid() == 0) {
+        kinds.push_back("foreign-file");
+        kinds.push_back("foreign-folder");
+    }
+    root.write("/etc/victim", "secret", 0600);
+    for (const std::string& kind : kinds) {
+        SCOPED_TRACE(kind);
+        StandInDaemon daemon(DumpMode::ANSWER);
+        WritePidFile(daemon.pid());
+        const std::string path = DebugFile(daemon.pid());
+        if (kind == "link") {
+            ASSERT_EQ(0, symlink(root.path("/etc/victim").c_str(), path.c_str()));
+        } else {
+            ASSERT_TRUE(zepatest::PlantHostile(kind, path));
+        }
+        StartSyslogRecorder();
+        // Pauses long enough for the stand-in to answer on a busy machine.
+        ZEPA::Relay::g_statusSleep = [](unsigned int) { usleep(10000); };
+        Json::Value out;
+        EXPECT_EQ(0, Daemon::DebugStatus(out));
+        ZEPA::Relay::g_statusSleep = NoSleep;
+        EXPECT_EQ(daemon.pid(), out["pid"].asInt());
+        EXPECT_TRUE(SyslogHas(LOG_WARNING, "removed what stood at " + path));
+        EXPECT_EQ("secret", root.read("/etc/victim"));
+        EXPECT_FALSE(zepatest::FileExists(path));
+        unlink((path + ".elsewhere").c_str());
         daemon.Stop();
     }
 }

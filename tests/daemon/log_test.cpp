@@ -159,6 +159,40 @@ TEST_F(LogTest, TruncateAndAppendFlagsDiffer) {
     EXPECT_EQ("", ReadFile(path));
 }
 
+// Where the log should be: a link, a FIFO, a folder, a second name of some
+// file. None is opened, truncated or blocked on; the target descriptor and
+// whatever the link names stay as they were.
+TEST_F(LogTest, OpenLogFileRefusesAnythingButAPlainFile) {
+    root.write("/etc/victim", "secret\n", 0600);
+    const std::string path = root.path("/var/log/planted.log");
+    root.mkdir("/var/log");
+    for (const char* kind : {"link", "fifo", "folder", "second-link"}) {
+        SCOPED_TRACE(kind);
+        zepatest::RemoveWithBad(path);
+        if (std::string(kind) == "link") {
+            ASSERT_EQ(0, symlink(root.path("/etc/victim").c_str(), path.c_str()));
+        } else if (std::string(kind) == "second-link") {
+            ASSERT_EQ(0, link(root.path("/etc/victim").c_str(), path.c_str()));
+        } else {
+            ASSERT_TRUE(zepatest::PlantHostile(kind, path));
+        }
+        for (int flags : {O_CREAT | O_TRUNC, O_CREAT | O_APPEND}) {
+            pid_t child = fork();
+            if (child == 0) {
+                alarm(10);  // a FIFO that blocked the open would end here
+                int target = dup(1);
+                _exit(Daemon::OpenLogFile(path, target, flags) ? 1 : 0);
+            }
+            int status = 0;
+            waitpid(child, &status, 0);
+            ASSERT_TRUE(WIFEXITED(status)) << "the open blocked or crashed";
+            EXPECT_EQ(0, WEXITSTATUS(status));
+        }
+        EXPECT_EQ("secret\n", zepatest::ReadFile(root.path("/etc/victim")));
+    }
+    zepatest::RemoveWithBad(path);
+}
+
 // Runs body in a child whose standard error is a pipe; returns what the child
 // wrote there and its exit status.
 template <typename F>

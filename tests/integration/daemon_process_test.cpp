@@ -398,14 +398,16 @@ public:
     pid_t pid;
 };
 
-// Neither tool signals a process that a stale PID file names; the daemon
-// starts over such a file.
+// Neither tool signals a process that took the pid of a stale PID file; the
+// daemon starts over such a file.
 TEST_F(DaemonProcess, AStalePidFileNamingAnotherProcessIsLeftAlone) {
     Bystander sleeper;
     ASSERT_GT(sleeper.pid, 0);
     ASSERT_TRUE(WaitUntil(
         [&] { return zepatest::ReadFile("/proc/" + std::to_string(sleeper.pid) + "/comm") == "sleep\n"; }));
+    // Left by a daemon that crashed an hour ago; the sleeper has its pid since.
     root.write("/var/run/zeparelayd.pid", std::to_string(sleeper.pid) + "\n");
+    ASSERT_TRUE(zepatest::SetAge(root.path("/var/run/zeparelayd.pid"), 3600));
 
     std::string out, err;
     EXPECT_EQ(1, Ctl({"status"}, &out));

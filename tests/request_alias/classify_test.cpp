@@ -111,6 +111,19 @@ TEST_F(ClassifyTest, OtherCurlFailuresAreUnknown) {
     }
 }
 
+// HTTPResponse takes any int: numbers that are no libcurl code (two bytes of
+// an answer taken as one, a negative number) are logged with libcurl's words
+// for an unknown code and classified as unknown, never turned into CURLcode.
+TEST_F(ClassifyTest, CodesOutsideLibcurlsRangeAreUnknown) {
+    const int kSlash = ('K' << 8) | '/';
+    for (int code : {kSlash, -1, static_cast<int>(CURL_LAST), 0x7fffffff}) {
+        Outcome o = Classify(code, -1, "K/");
+        EXPECT_FALSE(o.ok) << code;
+        EXPECT_EQ(ALIAS_RET_UNKNOWN, o.ret) << code;
+        EXPECT_TRUE(LogContains(o.log, "curl error: " + std::to_string(code) + ", Unknown error")) << o.log;
+    }
+}
+
 TEST_F(ClassifyTest, RepeatedCurlErrorIsLoggedOnce) {
     Outcome first = Classify(CURLE_COULDNT_CONNECT, 0, "");
     Outcome second = Classify(CURLE_COULDNT_CONNECT, 0, "");

@@ -7,6 +7,7 @@
 
 #include <cstring>
 #include <string>
+#include <vector>
 
 #include "support/test_support.h"
 
@@ -200,6 +201,34 @@ TEST_F(KvTest, WriteLeavesNoTemporaryFile) {
     while (fgets(line, sizeof(line), p)) listing += line;
     pclose(p);
     EXPECT_EQ(".\n..\ntest.conf\n", listing);
+}
+
+TEST_F(KvTest, WriteGoesThroughNothingPlantedAtTheTemporaryName) {
+    std::string f = file("runrelayd=\"no\"\n");
+    root.write("/etc/victim", "secret", 0600);
+    const std::string tmp = f + ".tmp." + std::to_string(getpid());
+    const std::vector<std::string> kinds = {"link", "fifo", "folder", "second-link", "stale"};
+    for (const std::string& kind : kinds) {
+        SCOPED_TRACE(kind);
+        if (kind == "link") {
+            ASSERT_EQ(0, symlink(root.path("/etc/victim").c_str(), tmp.c_str()));
+        } else if (kind == "fifo") {
+            ASSERT_EQ(0, mkfifo(tmp.c_str(), 0666));
+        } else if (kind == "folder") {
+            ASSERT_EQ(0, mkdir(tmp.c_str(), 0755));
+        } else if (kind == "second-link") {
+            ASSERT_EQ(0, link(root.path("/etc/victim").c_str(), tmp.c_str()));
+        } else {
+            // A leftover of an earlier write of ours, longer than the new text.
+            WriteFile(tmp, std::string(4000, 'x'), 0600);
+        }
+        ASSERT_EQ(0, VLIBCFileSetKeyValue(f.c_str(), "runrelayd", kind.c_str()));
+        EXPECT_EQ("runrelayd=\"" + kind + "\"\n", ReadFile(f));
+        EXPECT_EQ(0644u, FileMode(f));
+        EXPECT_FALSE(zepatest::FileExists(tmp));
+        EXPECT_EQ("secret", root.read("/etc/victim"));
+        EXPECT_EQ(0600u, FileMode(root.path("/etc/victim")));
+    }
 }
 
 // Parsed files are kept between calls: every kind of rewrite must be seen.

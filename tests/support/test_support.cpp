@@ -12,6 +12,7 @@
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <ctime>
 #include <fstream>
 #include <sstream>
 #include <stdexcept>
@@ -144,6 +145,25 @@ void WriteFile(const std::string& path, const std::string& content, mode_t mode)
 
 bool FileExists(const std::string& path) { return access(path.c_str(), F_OK) == 0; }
 
+std::string FindProgram(const std::string& name) {
+    const char* path = getenv("PATH");
+    std::istringstream dirs(path != nullptr ? path : "/usr/bin:/bin");
+    for (std::string dir; std::getline(dirs, dir, ':');) {
+        if (dir.empty()) continue;
+        const std::string candidate = dir + "/" + name;
+        if (access(candidate.c_str(), X_OK) == 0) return candidate;
+    }
+    return "";
+}
+
+bool SetAge(const std::string& path, int seconds) {
+    timespec times[2];
+    clock_gettime(CLOCK_REALTIME, &times[0]);
+    times[0].tv_sec -= seconds;
+    times[1] = times[0];
+    return utimensat(AT_FDCWD, path.c_str(), times, AT_SYMLINK_NOFOLLOW) == 0;
+}
+
 void RemoveWithBad(const std::string& path) {
     std::string cmd = "rm -rf '" + path + "' '" + path + ".bad'";
     if (system(cmd.c_str()) != 0) throw std::runtime_error("cannot remove " + path);
@@ -157,6 +177,24 @@ bool PlantHostile(const std::string& kind, const std::string& path) {
         return true;
     }
     if (kind == "device") return symlink("/dev/zero", path.c_str()) == 0;
+    // Another user's (65534) entries: only root can make them.
+    if (kind == "foreign-folder") {
+        MakeDirs(path + "/inside/deeper");
+        WriteFile(path + "/inside/file", "x");
+        if (symlink("/", (path + "/inside/to-root").c_str()) != 0) return false;
+        for (const char* sub : {"/inside/deeper", "/inside/file", "/inside/to-root", "/inside", ""})
+            if (lchown((path + sub).c_str(), 65534, 65534) != 0) return false;
+        return true;
+    }
+    if (kind == "foreign-file") {
+        WriteFile(path, "not yours", 0644);
+        return chown(path.c_str(), 65534, 65534) == 0;
+    }
+    if (kind == "second-link") {
+        const std::string other = path + ".elsewhere";
+        WriteFile(other, "kept", 0644);
+        return link(other.c_str(), path.c_str()) == 0;
+    }
     if (kind == "huge") {
         int fd = open(path.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
         if (fd < 0) return false;

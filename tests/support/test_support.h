@@ -70,8 +70,12 @@ bool LogContains(const std::string& captured, const std::string& needle);
 std::string ReadFile(const std::string& path);
 void WriteFile(const std::string& path, const std::string& content, mode_t mode = 0644);
 bool FileExists(const std::string& path);
+// Sets the modification time of path (not following a link) seconds into the past.
+bool SetAge(const std::string& path, int seconds);
 // Names in a folder, one per line.
 std::string ListDir(const std::string& dir);
+// The full path of a program found on PATH; empty when there is none.
+std::string FindProgram(const std::string& name);
 // Runs a program, waits for it and gives its exit status (-1 when it did not
 // exit normally); its standard output goes to out when given.
 int RunProgram(const std::vector<std::string>& args, std::string* out = nullptr, std::string* err = nullptr);
@@ -96,7 +100,10 @@ mode_t FileMode(const std::string& path);
 std::vector<std::string> TemporariesOf(const std::string& path);
 // Puts what a hostile local user might plant at path, after removing what
 // stood there: "fifo", "folder" (not empty), "device" (a link to /dev/zero),
-// "huge" (a sparse 1 GiB file) or "nested" (a JSON object nested 1,001 deep).
+// "huge" (a sparse 1 GiB file), "nested" (a JSON object nested 1,001 deep),
+// "second-link" (a second name of path + ".elsewhere"), and, as root only,
+// "foreign-folder" (a tree with a link to "/" in it) and "foreign-file" owned by
+// user 65534.
 // False for an unknown kind or a failed call.
 bool PlantHostile(const std::string& kind, const std::string& path);
 // rm -rf path and path + ".bad".

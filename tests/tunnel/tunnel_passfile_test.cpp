@@ -141,20 +141,21 @@ TEST_F(TunnelPassFile, LongContentIsCutAt1023Bytes) {
     EXPECT_EQ(0u, content.find("relayuser\npppp"));
 }
 
-TEST_F(TunnelPassFile, PlantedLinkIsNotWrittenThrough) {
+TEST_F(TunnelPassFile, PlantedLinkIsRemovedNotWrittenThrough) {
     root.write("/etc/victim", "keep me", 0644);
     ASSERT_EQ(0, symlink(root.path("/etc/victim").c_str(), PassPath().c_str()));
     Tunnel tunnel = MakeTunnel();
     zepatest::StderrCapture capture;
-    EXPECT_FALSE(tunnel.RunVPNTunnel("udp"));
+    EXPECT_TRUE(tunnel.WritePassFile(PassPath()));
     const std::string log = capture.stop();
 
     EXPECT_EQ("keep me", root.read("/etc/victim"));
     EXPECT_EQ(0644u, zepatest::FileMode(root.path("/etc/victim")));
-    EXPECT_TRUE(zepatest::LogContains(log, "open [" + PassPath() + "] failed")) << log;
-    EXPECT_FALSE(Called(1));
+    EXPECT_TRUE(zepatest::LogContains(log, "removed what stood at " + PassPath())) << log;
     struct stat st;
-    EXPECT_NE(0, lstat(PassPath().c_str(), &st));
+    ASSERT_EQ(0, lstat(PassPath().c_str(), &st));
+    EXPECT_TRUE(S_ISREG(st.st_mode));
+    EXPECT_EQ("relayuser\ns3cret-pass", zepatest::ReadFile(PassPath()));
 }
 
 TEST_F(TunnelPassFile, UnsafeUserNameIsRefusedBeforeAnyFile) {
@@ -198,19 +199,26 @@ TEST_F(TunnelPassFile, PlantedHardLinkNeverReceivesTheSecret) {
     ASSERT_EQ(0, link(root.path("/tmp/planted").c_str(), PassPath().c_str()));
     Tunnel tunnel = MakeTunnel();
     zepatest::StderrCapture capture;
-    EXPECT_FALSE(tunnel.WritePassFile(PassPath()));
+    EXPECT_TRUE(tunnel.WritePassFile(PassPath()));
     const std::string log = capture.stop();
     EXPECT_EQ("", root.read("/tmp/planted"));
-    EXPECT_TRUE(zepatest::LogContains(log, "open [" + PassPath() + "] failed, File exists")) << log;
+    EXPECT_EQ("relayuser\ns3cret-pass", zepatest::ReadFile(PassPath()));
+    EXPECT_TRUE(zepatest::LogContains(log, "removed what stood at " + PassPath())) << log;
 }
 
-TEST_F(TunnelPassFile, FolderAtTheNameIsRefused) {
-    zepatest::MakeDirs(PassPath() + "/inside");
-    Tunnel tunnel = MakeTunnel();
-    zepatest::StderrCapture capture;
-    EXPECT_FALSE(tunnel.WritePassFile(PassPath()));
-    capture.stop();
-    EXPECT_TRUE(zepatest::FileExists(PassPath() + "/inside"));
+TEST_F(TunnelPassFile, FolderOrFifoAtTheNameIsRemoved) {
+    for (const char* kind : {"folder", "fifo"}) {
+        SCOPED_TRACE(kind);
+        ASSERT_TRUE(zepatest::PlantHostile(kind, PassPath()));
+        Tunnel tunnel = MakeTunnel();
+        zepatest::StderrCapture capture;
+        EXPECT_TRUE(tunnel.WritePassFile(PassPath()));
+        const std::string log = capture.stop();
+        EXPECT_EQ("relayuser\ns3cret-pass", zepatest::ReadFile(PassPath()));
+        EXPECT_EQ(0600u, zepatest::FileMode(PassPath()));
+        EXPECT_TRUE(zepatest::LogContains(log, "removed what stood at " + PassPath())) << log;
+        unlink(PassPath().c_str());
+    }
 }
 
 // A pass file of our own left by an earlier start is replaced by a new one.
@@ -224,14 +232,22 @@ TEST_F(TunnelPassFile, OwnLeftoverIsReplacedWithTheNewSecret) {
     EXPECT_EQ(0600u, zepatest::FileMode(PassPath()));
 }
 
-// Run as root: a file of another user at the name is refused untouched.
-TEST_F(TunnelPassFile, AnotherUsersFileIsRefused) {
+// Run as root: a file or folder of another user at the name is removed and
+// the pass file made anew.
+TEST_F(TunnelPassFile, AnotherUsersFileOrFolderIsRemoved) {
     if (geteuid() != 0) GTEST_SKIP() << "needs root to give a file to another user";
-    zepatest::WriteFile(PassPath(), "theirs", 0644);
-    ASSERT_EQ(0, chown(PassPath().c_str(), 65534, 65534));
-    Tunnel tunnel = MakeTunnel();
-    zepatest::StderrCapture capture;
-    EXPECT_FALSE(tunnel.WritePassFile(PassPath()));
-    capture.stop();
-    EXPECT_EQ("theirs", zepatest::ReadFile(PassPath()));
+    for (const char* kind : {"foreign-file", "foreign-folder"}) {
+        SCOPED_TRACE(kind);
+        ASSERT_TRUE(zepatest::PlantHostile(kind, PassPath()));
+        Tunnel tunnel = MakeTunnel();
+        zepatest::StderrCapture capture;
+        EXPECT_TRUE(tunnel.WritePassFile(PassPath()));
+        capture.stop();
+        struct stat st;
+        ASSERT_EQ(0, lstat(PassPath().c_str(), &st));
+        EXPECT_TRUE(S_ISREG(st.st_mode));
+        EXPECT_EQ(0u, st.st_uid);
+        EXPECT_EQ("relayuser\ns3cret-pass", zepatest::ReadFile(PassPath()));
+        unlink(PassPath().c_str());
+    }
 }

@@ -1,6 +1,7 @@
 // Which process a signal of ours may reach: the one named in the PID file,
-// and only when it is a zeparelayd. A PID file left behind by a crash can
-// name any process once its number is reused.
+// and only while it is the process that wrote the file (Daemon::ProbeFilePid).
+// A PID file left behind by a crash can name any process once its number is
+// reused.
 #ifndef ZEPARELAYD_TOOL_DAEMON_PROCESS_H
 #define ZEPARELAYD_TOOL_DAEMON_PROCESS_H
 
@@ -19,15 +20,7 @@ struct PidFileState {
 // unreadable or holds no positive number.
 pid_t ReadPidFile(const std::string& path);
 
-// Whether pid lives and runs the program called name (its command name or
-// the file name of its executable).
-bool IsProgram(pid_t pid, const std::string& name);
-
-// The daemon's program name: the stem of the library's PID file.
-std::string DaemonName();
-
-// The daemon that the library's PID file names (Daemon::GetPidFile; the
-// program name is the file's stem).
+// The daemon that the library's PID file names (Daemon::GetPidFile).
 PidFileState DaemonFromPidFile();
 
 }  // namespace zepatools

@@ -4,6 +4,7 @@
 #include <time.h>
 #include <unistd.h>
 
+#include <cerrno>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
@@ -261,10 +262,11 @@ int CheckConfig(const Args& args, const Options&) {
     return ReportConfigCheck("zeparelayctl", args.empty() ? ConfPath() : args[0]) ? EXIT_OK : EXIT_CONFIG;
 }
 
-// Waits (bounded) until the process is gone.
+// Waits (bounded) until the process is gone: the daemon removes its PID
+// file a little before it ends.
 bool WaitGone(pid_t pid, int seconds) {
     for (int i = 0; i < seconds * 20; ++i) {
-        if (!IsProgram(pid, DaemonName())) return true;
+        if (kill(pid, 0) != 0 && errno == ESRCH) return true;
         SleepMs(50);
     }
     return false;

@@ -27,16 +27,36 @@ std::atomic<const std::string*> gText{nullptr};
 int CreateDumpTemporary() {
     const int flags = O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC;
     int fd = open(gTmp, flags, 0644);
-    if (fd < 0 && errno == EEXIST && unlink(gTmp) == 0) fd = open(gTmp, flags, 0644);
+    if (fd < 0 && errno == EEXIST && (unlink(gTmp) == 0 || (errno == EISDIR && rmdir(gTmp) == 0)))
+        fd = open(gTmp, flags, 0644);
     return fd;
 }
 
-// Async-signal-safe only: open, unlink, write, fchmod, close, rename.
+// When the temporary name stays blocked (a folder with something in it), the
+// dump goes into the debug file itself, which the query has just created:
+// only into a plain file with one name of root's or ours. The query reads
+// until the text parses.
+int OpenDumpInPlace() {
+    const int fd = open(gPath, O_WRONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC | O_NOCTTY);
+    if (fd < 0) return -1;
+    struct stat st;
+    if (fstat(fd, &st) != 0 || !S_ISREG(st.st_mode) || st.st_nlink != 1 ||
+        (st.st_uid != 0 && st.st_uid != geteuid()) || ftruncate(fd, 0) != 0) {
+        close(fd);
+        return -1;
+    }
+    return fd;
+}
+
+// Async-signal-safe only: open, unlink, rmdir, fstat, ftruncate, write,
+// fchmod, close, rename.
 void OnDumpSignal(int) {
     const int savedErrno = errno;
     const std::string* text = gText.load();
     if (text != nullptr) {
-        const int fd = CreateDumpTemporary();
+        int fd = CreateDumpTemporary();
+        const bool inPlace = fd < 0;
+        if (inPlace) fd = OpenDumpInPlace();
         if (fd >= 0) {
             const char* p = text->data();
             size_t left = text->size();
@@ -53,7 +73,7 @@ void OnDumpSignal(int) {
             }
             fchmod(fd, 0644);
             close(fd);
-            if (!ok || rename(gTmp, gPath) != 0) unlink(gTmp);
+            if (!inPlace && (!ok || rename(gTmp, gPath) != 0)) unlink(gTmp);
         }
     }
     errno = savedErrno;

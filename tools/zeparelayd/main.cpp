@@ -28,6 +28,7 @@
 #include "event_loop.h"
 #include "exit_codes.h"
 #include "log.h"
+#include "log_file_check.h"
 #include "relay_daemon.h"
 
 using namespace ZEPA::Relay;
@@ -174,6 +175,13 @@ int main(int argc, char** argv) {
         // points at the configured file from its first line on.
         RelaydConf early(confPath.c_str());
         zeparelayd::ApplyLogSettings(early);
+    }
+    // The child opens the log file after the fork, too late to refuse the start.
+    std::string why;
+    if (!opt.foreground && !LogFileUsable(Daemon::_strLogFile, why)) {
+        fprintf(stderr, "zeparelayd: not started: the log file %s %s; remove it or choose another\n",
+                Daemon::_strLogFile.c_str(), why.c_str());
+        return EXIT_CONFIG;
     }
     // Tools signal the daemon as soon as its PID file exists. So the signals
     // are held back from before the PID file is written, and their handlers
