@@ -229,3 +229,69 @@ TEST_F(RelayDaemonTest, RefusedTunnelIsAnErrorAndIsRetriedAfterABackOff) {
 }
 
 }  // namespace
+
+namespace {
+
+// Milliseconds from now until cond holds, -1 when it did not within maxMs.
+int64_t MsUntil(const std::function<bool()>& cond, int maxMs) {
+    const auto start = std::chrono::steady_clock::now();
+    const auto end = start + std::chrono::milliseconds(maxMs);
+    for (;;) {
+        if (cond()) {
+            return std::chrono::duration_cast<std::chrono::milliseconds>(std::chrono::steady_clock::now() -
+                                                                         start)
+                .count();
+        }
+        if (std::chrono::steady_clock::now() >= end) return -1;
+        std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    }
+}
+
+TEST_F(RelayDaemonTest, SilentRelayEveryCommandIsAnsweredDuringTheStartAndStopLeavesNothing) {
+    ASSERT_TRUE(relay.Silence(true));
+    ASSERT_EQ(0, StartDaemon());
+    ASSERT_TRUE(WaitUntil([&] { return StatusFile()["tunnel"].isMember("starting"); }, 15000))
+        << CtlStatus() << Log();
+    const std::string user = StatusFile()["tunnel"]["relay_user"].asString();
+    ASSERT_FALSE(user.empty());
+    EXPECT_TRUE(root.exists("/tmp/.tunnel." + user));
+
+    for (int round = 0; round < 3; ++round) {
+        // The debug dump answers at once.
+        std::string out;
+        EXPECT_EQ(0, Ctl({"status", "--debug"}, &out)) << out;
+        EXPECT_NE(std::string::npos, out.find("\"starting\"")) << out;
+        // The alias exchange starts within a second.
+        const size_t aliasBefore = relay.server().requests("/alias_update.php").size();
+        ASSERT_EQ(0, Ctl({"update-alias"}, &out)) << out;
+        EXPECT_GE(
+            MsUntil([&] { return relay.server().requests("/alias_update.php").size() > aliasBefore; }, 1000),
+            0)
+            << "update-alias not started within 1 s";
+        // A reload is applied within a second: it registers again.
+        const size_t registrationsBefore = relay.server().requests("/Serv.php").size();
+        ASSERT_EQ(0, Ctl({"reload"}, &out)) << out;
+        EXPECT_GE(
+            MsUntil([&] { return relay.server().requests("/Serv.php").size() > registrationsBefore; }, 1000),
+            0)
+            << "reload not applied within 1 s";
+        ASSERT_TRUE(WaitUntil([&] { return StatusFile()["tunnel"].isMember("starting"); }, 5000))
+            << CtlStatus();
+        // No READY without a peer address.
+        EXPECT_NE(6, State());
+        EXPECT_NE("READY", StatusFile()["tunnel"]["status"].asString());
+        std::this_thread::sleep_for(std::chrono::milliseconds(500));
+    }
+    EXPECT_EQ(std::string::npos, CtlStatus().find("READY")) << CtlStatus();
+    EXPECT_EQ(std::string::npos, Log().find("tunnel up")) << Log();
+
+    // Stop during the start: no openvpn, pass file or tunnel info file stays.
+    std::string out;
+    EXPECT_EQ(0, Ctl({"stop"}, &out)) << out;
+    EXPECT_EQ(0, VpnClients());
+    EXPECT_FALSE(root.exists("/tmp/.tunnel." + user));
+    EXPECT_FALSE(root.exists("/tmp/.zepa_farlink_tunnel_info"));
+    EXPECT_EQ(8, State());
+}
+
+}  // namespace

@@ -30,7 +30,7 @@ RelayDaemon::RelayDaemon(const std::string& confPath, EventLoop& loop, const Clo
                                              [this](const Json::Value& answer) { OnRegistered(answer); },
                                              [this] {
                                                  _alias.Stop();
-                                                 _tunnel.Stop(true);
+                                                 _tunnel.Stop(false);
                                              }}),
       _alias(*_conf, loop, clock,
              AliasCycle::Hooks{[this] { return IsRegistered(); }, [this] { WriteStatus(); }}),
@@ -97,14 +97,18 @@ void RelayDaemon::HandleSignal(int sig) {
             Reload();
             break;
         case SIGCHLD:
-            ReapChildren();
+            // The tunnel reaps its own children first: it needs their end.
             _tunnel.OnChildExited();
+            ReapChildren();
+            break;
+        case SIGUSR2:
+            _tunnel.OnUpSignal();
             break;
         default:
             // SIGUSR1 comes this way only before the dump handler took it over
             // (debug_dump.h); that query then sees no answer and may ask again.
-            // SIGPIPE, SIGALRM, SIGUSR2, SIGRTMIN+5: their handlers only have to
-            // exist (the tunnel's wait relies on them); nothing to do here.
+            // SIGPIPE, SIGALRM, SIGRTMIN+5: their handlers only have to exist;
+            // nothing to do here.
             RLOG(LOG_DEBUG, "signal %d ignored", sig);
             break;
     }
@@ -133,7 +137,8 @@ void RelayDaemon::Reload() {
     if (!_conf->enable) _alias.DeleteOnDisable();
     _alias.Reset();
     // A new configuration may name other servers: the tunnel starts afresh.
-    _tunnel.Stop(true);
+    // Its child ends in the background; the next start waits for it.
+    _tunnel.Stop(false);
     _registration.Restart();
 }
 
