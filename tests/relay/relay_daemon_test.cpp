@@ -7,7 +7,10 @@
 #include <unistd.h>
 
 #include <chrono>
+#include <fstream>
 #include <functional>
+#include <iostream>
+#include <iterator>
 #include <sstream>
 #include <thread>
 
@@ -292,6 +295,63 @@ TEST_F(RelayDaemonTest, SilentRelayEveryCommandIsAnsweredDuringTheStartAndStopLe
     EXPECT_FALSE(root.exists("/tmp/.tunnel." + user));
     EXPECT_FALSE(root.exists("/tmp/.zepa_farlink_tunnel_info"));
     EXPECT_EQ(8, State());
+}
+
+}  // namespace
+
+namespace {
+
+TEST_F(RelayDaemonTest, KillNineWithTheTunnelUpThenStartEndsTheOldOpenvpnAndComesBack) {
+    ASSERT_EQ(0, StartDaemon());
+    ASSERT_TRUE(StatusHas("tunnel: READY")) << CtlStatus() << Log();
+    const pid_t daemon = DaemonPid();
+    const int oldVpn = StatusFile()["tunnel"]["pid"].asInt();
+    ASSERT_GT(oldVpn, 0);
+    ASSERT_EQ(0, kill(daemon, SIGKILL));
+    ASSERT_TRUE(WaitUntil([&] { return kill(daemon, 0) != 0; }, 5000));
+    // Left behind: the openvpn, still connected, and a status saying READY.
+    ASSERT_EQ(1, VpnClients());
+    ASSERT_EQ(6, State());
+
+    const auto start = std::chrono::steady_clock::now();
+    ASSERT_EQ(0, StartDaemon());
+    ASSERT_TRUE(WaitUntil([&] { return State() == 6 && StatusFile()["pid"].asInt() != daemon; }, 20000))
+        << CtlStatus() << Log();
+    ASSERT_TRUE(WaitUntil([&] { return Page().find("200 ") == 0; }, 10000)) << Page();
+    const auto ms =
+        std::chrono::duration_cast<std::chrono::milliseconds>(std::chrono::steady_clock::now() - start)
+            .count();
+    std::cout << "kill -9 with the tunnel up: READY and the page " << ms << " ms after the start\n";
+    EXPECT_EQ(1, VpnClients());
+    EXPECT_NE(oldVpn, StatusFile()["tunnel"]["pid"].asInt());
+    // The old openvpn is gone (its number may have been reused by now).
+    std::ifstream oldCommand("/proc/" + std::to_string(oldVpn) + "/cmdline", std::ios::binary);
+    const std::string oldLine((std::istreambuf_iterator<char>(oldCommand)), std::istreambuf_iterator<char>());
+    EXPECT_EQ(std::string::npos, oldLine.find(root.dir())) << oldLine;
+    EXPECT_NE(std::string::npos,
+              Log().find("ending openvpn " + std::to_string(oldVpn) + " left by an earlier run"))
+        << Log();
+    const std::string listing = zepatest::ListDir(root.path("/tmp"));
+    EXPECT_EQ(std::string::npos, listing.find(".tunnel.")) << listing;
+}
+
+TEST_F(RelayDaemonTest, KillNineDuringTheStartLeavesNothingAfterTheNextStart) {
+    ASSERT_TRUE(relay.Silence(true));
+    ASSERT_EQ(0, StartDaemon());
+    ASSERT_TRUE(WaitUntil([&] { return StatusFile()["tunnel"]["pid"].asInt() > 0; }, 15000)) << CtlStatus();
+    const std::string user = StatusFile()["tunnel"]["relay_user"].asString();
+    ASSERT_TRUE(root.exists("/tmp/.tunnel." + user));
+    const pid_t daemon = DaemonPid();
+    ASSERT_EQ(0, kill(daemon, SIGKILL));
+    ASSERT_TRUE(WaitUntil([&] { return kill(daemon, 0) != 0; }, 5000));
+    ASSERT_TRUE(relay.Silence(false));
+
+    ASSERT_EQ(0, StartDaemon());
+    ASSERT_TRUE(WaitUntil([&] { return State() == 6 && StatusFile()["pid"].asInt() != daemon; }, 30000))
+        << CtlStatus() << Log();
+    EXPECT_EQ(1, VpnClients());
+    EXPECT_FALSE(root.exists("/tmp/.tunnel." + user));
+    EXPECT_NE(std::string::npos, Log().find("left by an earlier run")) << Log();
 }
 
 }  // namespace

@@ -28,6 +28,7 @@
 #include "event_loop.h"
 #include "exit_codes.h"
 #include "log.h"
+#include "recovery.h"
 #include "relay_daemon.h"
 
 using namespace ZEPA::Relay;
@@ -214,6 +215,8 @@ int main(int argc, char** argv) {
         } else {
             loop.OnSignal([&relay](int sig) { relay.HandleSignal(sig); });
             loop.OnIdle([&relay] { relay.Idle(); });
+            // Before any tunnel: never two openvpn for one appliance.
+            zeparelayd::RemoveLeftovers();
             const bool started = relay.Start();
             sigprocmask(SIG_SETMASK, &previous, nullptr);
             if (!started || !loop.Run()) status = EXIT_NO_LOOP;

@@ -58,8 +58,12 @@ public:
     bool Start();
     // What each signal asks of the daemon; stop signals end the loop.
     void HandleSignal(int sig);
-    // After every round of events: refresh what SIGUSR1 will write.
-    void Idle() { RenderDebugDump(); }
+    // After every round of events: the status file (written when it changed)
+    // and what SIGUSR1 will write.
+    void Idle() {
+        WriteStatus();
+        RenderDebugDump();
+    }
     // Final status ("stoped"); the caller removes the PID file.
     void Shutdown();
 
