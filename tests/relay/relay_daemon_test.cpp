@@ -250,6 +250,12 @@ int64_t MsUntil(const std::function<bool()>& cond, int maxMs) {
     }
 }
 
+size_t Count(const std::string& text, const std::string& needle) {
+    size_t n = 0;
+    for (size_t at = text.find(needle); at != std::string::npos; at = text.find(needle, at + 1)) ++n;
+    return n;
+}
+
 TEST_F(RelayDaemonTest, SilentRelayEveryCommandIsAnsweredDuringTheStartAndStopLeavesNothing) {
     ASSERT_TRUE(relay.Silence(true));
     ASSERT_EQ(0, StartDaemon());
@@ -271,15 +277,18 @@ TEST_F(RelayDaemonTest, SilentRelayEveryCommandIsAnsweredDuringTheStartAndStopLe
             MsUntil([&] { return relay.server().requests("/alias_update.php").size() > aliasBefore; }, 1000),
             0)
             << "update-alias not started within 1 s";
-        // A reload is applied within a second: it registers again.
-        const size_t registrationsBefore = relay.server().requests("/Serv.php").size();
+        // A reload is applied within a second; with nothing changed the
+        // start under way goes on.
+        const int vpnPid = StatusFile()["tunnel"]["pid"].asInt();
+        const size_t reloadsBefore = Count(Log(), "reload: nothing changed");
         ASSERT_EQ(0, Ctl({"reload"}, &out)) << out;
-        EXPECT_GE(
-            MsUntil([&] { return relay.server().requests("/Serv.php").size() > registrationsBefore; }, 1000),
-            0)
+        EXPECT_GE(MsUntil([&] { return Count(Log(), "reload: nothing changed") > reloadsBefore; }, 1000), 0)
             << "reload not applied within 1 s";
         ASSERT_TRUE(WaitUntil([&] { return StatusFile()["tunnel"].isMember("starting"); }, 5000))
             << CtlStatus();
+        if (vpnPid > 0 && StatusFile()["tunnel"]["starting"].asString() == "udp") {
+            EXPECT_EQ(vpnPid, StatusFile()["tunnel"]["pid"].asInt());
+        }
         // No READY without a peer address.
         EXPECT_NE(6, State());
         EXPECT_NE("READY", StatusFile()["tunnel"]["status"].asString());
@@ -352,6 +361,34 @@ TEST_F(RelayDaemonTest, KillNineDuringTheStartLeavesNothingAfterTheNextStart) {
     EXPECT_EQ(1, VpnClients());
     EXPECT_FALSE(root.exists("/tmp/.tunnel." + user));
     EXPECT_NE(std::string::npos, Log().find("left by an earlier run")) << Log();
+}
+
+}  // namespace
+
+namespace {
+
+TEST_F(RelayDaemonTest, ReloadWithNothingChangedKeepsTheTunnelRegistrationAndAlias) {
+    ASSERT_EQ(0, StartDaemon());
+    ASSERT_TRUE(StatusHas("tunnel: READY")) << CtlStatus() << Log();
+    ASSERT_TRUE(StatusHas("alias_status: good")) << CtlStatus();
+    const int vpnPid = StatusFile()["tunnel"]["pid"].asInt();
+    const size_t registrations = relay.server().requests("/Serv.php").size();
+    const size_t aliasUpdates = relay.server().requests("/alias_update.php").size();
+
+    std::string out;
+    ASSERT_EQ(0, Ctl({"reload"}, &out)) << out;
+    ASSERT_TRUE(WaitUntil([&] { return Log().find("reload: nothing changed") != std::string::npos; }, 5000))
+        << Log();
+    // The page stays reachable all the while.
+    for (int i = 0; i < 5; ++i) {
+        EXPECT_EQ(0u, Page().find("200 "));
+        std::this_thread::sleep_for(std::chrono::milliseconds(200));
+    }
+    EXPECT_EQ(6, State());
+    EXPECT_EQ(vpnPid, StatusFile()["tunnel"]["pid"].asInt());
+    EXPECT_EQ(registrations, relay.server().requests("/Serv.php").size());
+    EXPECT_EQ(aliasUpdates, relay.server().requests("/alias_update.php").size());
+    EXPECT_EQ(1, VpnClients());
 }
 
 }  // namespace

@@ -43,6 +43,8 @@ public:
     void DeleteOnDisable();
     // An exchange is running or scheduled (a heartbeat leaves it alone).
     bool Pending() const;
+    // A stop-class answer halted the automatic exchanges until a reload.
+    bool Halted() const { return _policy.Halted(); }
 
     // The word of the last outcome, as the status shows it.
     const std::string& Word() const { return _word; }

@@ -29,7 +29,8 @@ void RelayDaemon::SetState(RELAYD_STATE state, RELAYD_RET error) {
     }
     _state = state;
     _error = error;
-    WriteStatus();
+    // Written after the round (Idle), or at once when the loop has ended.
+    if (!_loop.Running()) WriteStatus();
 }
 
 namespace {
