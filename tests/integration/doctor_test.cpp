@@ -193,7 +193,7 @@ TEST_F(Doctor, StatusFileTellsWhenResultsCameAndWhatIsNext) {
     plan["body"] = "busy";
     plan["count"] = 5;
     ASSERT_TRUE(server.scriptRaw(plan));
-    ASSERT_EQ(0, Ctl({"reload"}));
+    ASSERT_EQ(0, ReloadToRegisterAgain());
     ASSERT_TRUE(WaitUntil([&] { return StatusFile()["registration_retry_at"].isIntegral(); }));
     const Json::Value failed = StatusFile();
     EXPECT_EQ(3, failed["state"].asInt());

@@ -114,9 +114,9 @@ Json::Value RelayDaemon::DebugDump() const {
     return MaskSecrets(dump);
 }
 
+// The status file follows in Idle, after every round too, so a retry planned
+// after the last write shows up there as well.
 void RelayDaemon::RenderDebugDump() {
-    // A retry planned after the last write shows up in the status file too.
-    WriteStatus();
     Json::StreamWriterBuilder writer;
     writer["indentation"] = "   ";
     PublishDebugDump(Json::writeString(writer, DebugDump()) + "\n");
