@@ -28,7 +28,8 @@ public:
         std::function<void()> changed;
     };
 
-    AliasCycle(ZEPA::Relay::RelaydConf& conf, EventLoop& loop, const Clock& clock, Hooks hooks);
+    AliasCycle(ZEPA::Relay::RelaydConf& conf, EventLoop& loop, const Clock& clock, Hooks hooks,
+               RandomSource random = SystemRandom());
 
     void OnRegistered();
     // Someone asked for an update now; runs even after a stop-class answer.

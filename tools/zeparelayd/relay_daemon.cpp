@@ -19,7 +19,8 @@ using namespace ZEPA::Relay;
 
 namespace zeparelayd {
 
-RelayDaemon::RelayDaemon(const std::string& confPath, EventLoop& loop, const Clock& clock)
+RelayDaemon::RelayDaemon(const std::string& confPath, EventLoop& loop, const Clock& clock,
+                         RandomSource random)
     : _loop(loop),
       _clock(clock),
       _conf(new RelaydConf(confPath.c_str())),
@@ -31,12 +32,13 @@ RelayDaemon::RelayDaemon(const std::string& confPath, EventLoop& loop, const Clo
                                              [this] {
                                                  _alias.Stop();
                                                  _tunnel.Stop(false);
-                                             }}),
-      _alias(*_conf, loop, clock, AliasCycle::Hooks{[this] { return IsRegistered(); }, nullptr}),
+                                             }},
+                    random),
+      _alias(*_conf, loop, clock, AliasCycle::Hooks{[this] { return IsRegistered(); }, nullptr}, random),
       _tunnel(loop, clock,
               TunnelCycle::Hooks{[this](RELAYD_STATE s, RELAYD_RET e) { SetState(s, e); },
                                  [this] { _registration.Start(IsRegistered()); }},
-              [] { return random(); }) {}
+              random) {}
 
 bool RelayDaemon::IsRegistered() const {
     return _state == RELAYD_STATE_DIRECT_CONNECT || _state == RELAYD_STATE_CONNECTED ||

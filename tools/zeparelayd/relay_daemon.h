@@ -54,7 +54,9 @@ Json::Value AliasInputs(ZEPA::Relay::RelaydConf& conf);
 //   8 "stoped"     the daemon has stopped (written last, on the way out)
 class RelayDaemon {
 public:
-    RelayDaemon(const std::string& confPath, EventLoop& loop, const Clock& clock);
+    // random: the jitter of every cycle's retries.
+    RelayDaemon(const std::string& confPath, EventLoop& loop, const Clock& clock,
+                RandomSource random = SystemRandom());
 
     // Log settings of the configuration; called at start and on every reload.
     void ApplyLogSettings();

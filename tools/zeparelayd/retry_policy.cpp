@@ -1,5 +1,7 @@
 #include "retry_policy.h"
 
+#include <stdlib.h>
+
 #include <algorithm>
 
 using namespace ZEPA::Relay;
@@ -31,6 +33,10 @@ int64_t Deadline::RemainingMs() const {
 }
 
 // ---- registration ------------------------------------------------------------
+
+RandomSource SystemRandom() {
+    return [] { return random(); };
+}
 
 RegistrationPolicy::RegistrationPolicy(const Clock& clock, RandomSource random)
     : _random(std::move(random)), _due(clock), _failures(0), _moves(0), _halted(false) {}

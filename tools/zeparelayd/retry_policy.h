@@ -18,6 +18,8 @@ namespace zeparelayd {
 
 // Source of jitter: random() in the daemon, chosen values in tests.
 using RandomSource = std::function<long()>;
+// The daemon's source: random().
+RandomSource SystemRandom();
 
 // A wait that was decided, and when it runs out.
 class Deadline {
