@@ -41,3 +41,16 @@ fi
 
 step "Figures (staged appliance, local server, real daemon)"
 python3 bench/figures/bench.py --build "$build" --src . "${smoke[@]}" || fail "the figures failed (see above)"
+
+# The relay figures need the tests' relay harness (a test build) and root.
+relay_bench=${ZEPA_TEST_BUILD:-build/plain}/bench/relay/bench_relay
+if [ "$(id -u)" != 0 ]; then
+  step "Relay figures skipped: they need root (network namespaces, openvpn)"
+elif [ ! -x "$relay_bench" ]; then
+  step "Relay figures skipped: build $relay_bench first (cmake --build build/plain --target bench_relay)"
+else
+  step "Relay figures (real openvpn in namespaces, the daemon against a silent relay, kill -9, reload)"
+  rounds=3
+  [ ${#smoke[@]} -gt 0 ] && rounds=1
+  "$relay_bench" "$rounds" || fail "bench_relay failed (see above)"
+fi

@@ -73,6 +73,78 @@ bool Get(const zepatest::RelayHarness& relay, const std::string& path, size_t* b
     return ok;
 }
 
+// ZEPA_BENCH_DAEMON / ZEPA_BENCH_CTL measure another build (an earlier one,
+// for before/after figures).
+std::string Program(const char* env, const std::string& built) {
+    const char* other = getenv(env);
+    return other != nullptr && *other != '\0' ? other : built;
+}
+const std::string kDaemon = Program("ZEPA_BENCH_DAEMON", ZEPA_BINARY_DIR "/tools/zeparelayd/zeparelayd");
+const std::string kCtl = Program("ZEPA_BENCH_CTL", ZEPA_BINARY_DIR "/tools/zeparelayctl/zeparelayctl");
+
+size_t Count(const std::string& text, const std::string& needle) {
+    size_t n = 0;
+    for (size_t at = text.find(needle); at != std::string::npos; at = text.find(needle, at + 1)) ++n;
+    return n;
+}
+
+// Milliseconds until cond holds (polled every 2 ms), -1 after maxMs.
+template <typename Cond>
+double MsUntil(Clock::time_point t0, Cond cond, int maxMs) {
+    while (Ms(t0, Clock::now()) < maxMs) {
+        if (cond()) return Ms(t0, Clock::now());
+        std::this_thread::sleep_for(std::chrono::milliseconds(2));
+    }
+    return -1;
+}
+
+void Goal(const char* what, double worstMs, double goalMs) {
+    if (worstMs < 0) {
+        printf("  %-52s no answer          (goal <= %.0f ms)  MISSED\n", what, goalMs);
+        return;
+    }
+    printf("  %-52s %8.1f ms  (goal <= %.0f ms)  %s\n", what, worstMs, goalMs,
+           worstMs <= goalMs ? "met" : "MISSED");
+}
+
+struct DaemonRun {
+    zepatest::TempRoot& root;
+    zepatest::RelayHarness& relay;
+    std::string alias;
+
+    int Ctl(const std::vector<std::string>& args) {
+        std::vector<std::string> all = {kCtl, "--root", root.dir()};
+        all.insert(all.end(), args.begin(), args.end());
+        std::string out;
+        return zepatest::RunProgram(all, &out);
+    }
+    std::string Log() const { return root.read("/var/log/zeparelayd.log"); }
+    std::string Status() const { return root.read("/tmp/.zeparelayd.status"); }
+    pid_t Pid() const {
+        return root.exists("/var/run/zeparelayd.pid") ? atoi(root.read("/var/run/zeparelayd.pid").c_str())
+                                                      : -1;
+    }
+    bool Ready(pid_t notPid) const {
+        const std::string st = Status();
+        return st.find("\"state\" : 6") != std::string::npos && Pid() != notPid &&
+               st.find("\"pid\" : " + std::to_string(Pid())) != std::string::npos;
+    }
+    bool Page() const {
+        std::string body;
+        long status = 0;
+        return relay.HttpsGet("/" + alias + "/", body, status, 2) && status == 200;
+    }
+    int Start() {
+        return zepatest::RunProgram({kDaemon, "--root", root.dir(), "--ca-file", relay.server().caFile()});
+    }
+    void Stop() {
+        const pid_t pid = Pid();
+        Ctl({"stop"});
+        for (int i = 0; pid > 0 && i < 500 && kill(pid, 0) == 0; ++i)
+            std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    }
+};
+
 }  // namespace
 
 int main(int argc, char** argv) {
@@ -173,7 +245,7 @@ int main(int argc, char** argv) {
          << relay.server().httpsPort() << "}, \"server_alias\": {\"alias\": \"daemon" << getpid()
          << "\", \"url\": \"" << relay.server().httpsUrl() << "\"}, \"service\": [{\"id\": \"nos\"}]}\n";
     root.write("/usr/zepa/etc/zeparelayd/zeparelayd.conf", conf.str());
-    const std::string daemonPath = ZEPA_BINARY_DIR "/tools/zeparelayd/zeparelayd";
+    const std::string daemonPath = kDaemon;
     const auto d0 = Clock::now();
     const int started =
         zepatest::RunProgram({daemonPath, "--root", root.dir(), "--ca-file", relay.server().caFile()});
@@ -195,6 +267,113 @@ int main(int argc, char** argv) {
             for (int i = 0; i < 500 && kill(pid, 0) == 0; ++i)
                 std::this_thread::sleep_for(std::chrono::milliseconds(10));
         }
+    }
+    // ---- the daemon's answers and its restart, with goals ----------------
+    printf("\nThe daemon (goals):\n");
+    {
+        DaemonRun d{root, relay, "daemon" + std::to_string(getpid())};
+        std::ostringstream c2;
+        c2 << "{\"server_control\": {\"protocol\": \"https\", \"host\": \"127.0.0.1\", \"port\": "
+           << relay.server().httpsPort() << "}, \"server_alias\": {\"alias\": \"" << d.alias
+           << "\", \"url\": \"" << relay.server().httpsUrl()
+           << "\"}, \"service\": [{\"id\": \"nos\"}], \"log_level\": 7, \"log_file\": "
+              "\"/var/log/zeparelayd.log\"}\n";
+        root.write("/usr/zepa/etc/zeparelayd/zeparelayd.conf", c2.str());
+        if (d.Start() != 0 || MsUntil(
+                                  Clock::now(), [&] { return d.Ready(-1) && d.Page(); }, 60000) < 0) {
+            printf("  the daemon did not come up: %s\n", d.Status().c_str());
+            d.Stop();
+            return 1;
+        }
+        // Page interruption across a reload with nothing changed.
+        double worstGap = 0;
+        int failed = 0;
+        auto lastOk = Clock::now();
+        d.Ctl({"reload"});
+        const auto r0 = Clock::now();
+        while (Ms(r0, Clock::now()) < 4000) {
+            if (d.Page()) {
+                worstGap = std::max(worstGap, Ms(lastOk, Clock::now()) - 100);
+                lastOk = Clock::now();
+            } else {
+                ++failed;
+            }
+            std::this_thread::sleep_for(std::chrono::milliseconds(50));
+        }
+        printf("  %-52s %d failed GETs, longest gap %.0f ms  (goal: none)  %s\n",
+               "page across a reload with nothing changed", failed, std::max(0.0, worstGap),
+               failed == 0 ? "met" : "MISSED");
+
+        // Restart after kill -9 with the tunnel up.
+        std::vector<double> restart;
+        for (int i = 0; i < std::min(rounds, 3); ++i) {
+            const pid_t old = d.Pid();
+            kill(old, SIGKILL);
+            for (int j = 0; j < 500 && kill(old, 0) == 0; ++j)
+                std::this_thread::sleep_for(std::chrono::milliseconds(10));
+            const auto k0 = Clock::now();
+            if (d.Start() != 0) break;
+            const double ms = MsUntil(
+                k0, [&] { return d.Ready(old) && d.Page(); }, 60000);
+            if (ms < 0) break;
+            restart.push_back(ms);
+        }
+        Goal("kill -9, start, READY and the page (worst)",
+             restart.empty() ? -1 : *std::max_element(restart.begin(), restart.end()), 5000);
+        printf("  %-52s %zu\n", "openvpn processes of this root afterwards",
+               static_cast<size_t>(zepatest::RelayHarness::CountProcesses(root.dir() + "/tmp/.tunnel.")));
+        d.Stop();
+
+        // Every control command during a tunnel start against a silent relay.
+        relay.Silence(true);
+        if (d.Start() != 0 || MsUntil(
+                                  Clock::now(),
+                                  [&] {
+                                      const std::string st = d.Status();
+                                      return st.find("\"state\" : 5") != std::string::npos &&
+                                             st.find("\"tunnel\"") != std::string::npos;
+                                  },
+                                  30000) < 0) {
+            printf("  no tunnel start against the silent relay: %s\n", d.Status().c_str());
+        } else {
+            double status = 0, debug = 0, alias = 0, reload = 0;
+            int debugFailed = 0;
+            const auto s0 = Clock::now();
+            int n = 0;
+            while (Ms(s0, Clock::now()) < 12000 * std::max(1, rounds / 5)) {
+                auto t0 = Clock::now();
+                d.Ctl({"status"});
+                status = std::max(status, Ms(t0, Clock::now()));
+                t0 = Clock::now();
+                if (d.Ctl({"status", "--debug"}) != 0) ++debugFailed;
+                debug = std::max(debug, Ms(t0, Clock::now()));
+                std::string log = d.Log();
+                size_t before = Count(log, "alias update requested");
+                t0 = Clock::now();
+                d.Ctl({"update-alias"});
+                const double a = MsUntil(
+                    t0, [&] { return Count(d.Log(), "alias update requested") > before; }, 5000);
+                alias = a < 0 || alias < 0 ? -1 : std::max(alias, a);
+                log = d.Log();
+                before = Count(log, "reloading configuration");
+                t0 = Clock::now();
+                d.Ctl({"reload"});
+                const double r = MsUntil(
+                    t0, [&] { return Count(d.Log(), "reloading configuration") > before; }, 5000);
+                reload = r < 0 || reload < 0 ? -1 : std::max(reload, r);
+                ++n;
+                std::this_thread::sleep_for(std::chrono::milliseconds(200));
+            }
+            const bool ready = d.Status().find("READY") != std::string::npos;
+            printf("  silent relay: %d rounds over %.0f s of one tunnel start, READY shown: %s\n", n,
+                   Ms(s0, Clock::now()) / 1000, ready ? "yes (wrong)" : "no");
+            Goal("status (worst)", status, 50);
+            Goal("status --debug (worst)", debugFailed > 0 ? -1 : debug, 50);
+            Goal("update-alias until its exchange starts (worst)", alias, 50);
+            Goal("reload until applied (worst)", reload, 50);
+        }
+        d.Stop();
+        relay.Silence(false);
     }
     return 0;
 }

@@ -70,6 +70,12 @@ public:
     static std::string GetModuleToolPath();
     static std::string GetTunDevicePath();
 
+    // Where a start keeps the credentials for openvpn ("/tmp/.tunnel.<user>"
+    // below the system root); empty for a user name that is refused.
+    static std::string GetPassFilePath(const std::string& user);
+    // The key/value file the up script writes, below the system root.
+    static std::string GetInfoFilePath();
+
     int pid;  // -1: no child
     std::string relay_ip;
     std::string relay_user;

@@ -3,7 +3,9 @@
 #define ZEPA_LOG_SOURCE "tunnel"
 
 #include <signal.h>
+
 #include <zepasdk/kv.h>
+#include <cstdio>
 
 #include <zeparelayd/tunnel.h>
 
@@ -172,6 +174,15 @@ std::string Tunnel::GetUpScriptPath() { return Paths::Resolve(Paths::TUNNEL_UP_S
 std::string Tunnel::GetDownScriptPath() { return Paths::Resolve(Paths::TUNNEL_DOWN_SCRIPT); }
 std::string Tunnel::GetModuleToolPath() { return Paths::Resolve(Paths::IPTABLESTOOL); }
 std::string Tunnel::GetTunDevicePath() { return Paths::Resolve(Paths::TUN_DEVICE); }
+
+std::string Tunnel::GetPassFilePath(const std::string& user) {
+    if (user.empty() || !IsSafeTunnelUser(user)) return std::string();
+    char name[1024];
+    snprintf(name, sizeof(name), Paths::TUNNEL_PASS_FORMAT, user.c_str());
+    return Paths::Resolve(name);
+}
+
+std::string Tunnel::GetInfoFilePath() { return Paths::Resolve(Paths::TUNNEL_INFO_FILE); }
 
 }  // namespace Relay
 }  // namespace ZEPA

@@ -274,7 +274,7 @@ TEST_F(DaemonUnderAttack, GigabyteAnswersCostNeitherMemoryNorLog) {
 
     ASSERT_TRUE(StreamNext("/Serv.php", kGigabyte));
     const int regs = Requests("/Serv.php");
-    ASSERT_EQ(0, Ctl({"reload"}));
+    ASSERT_EQ(0, ReloadToRegisterAgain());
     ASSERT_TRUE(Handled("/Serv.php", regs + 1, "register"));
     ExpectAnswering(pid);
     EXPECT_EQ(0, Ctl({"status"}));

@@ -100,6 +100,20 @@ protected:
         root.write("/usr/zepa/etc/zeparelayd/zeparelayd.conf", conf.str());
     }
 
+    // A reload registers again only when something the registration depends
+    // on changed: the service list alternates between two services and one.
+    // Everything else in the file (the server id the daemon stored) stays.
+    int ReloadToRegisterAgain() {
+        oneService = !oneService;
+        Json::Value conf = zepatest::ParseJson(root.read("/usr/zepa/etc/zeparelayd/zeparelayd.conf"));
+        Json::Value services(Json::arrayValue);
+        services[0u]["id"] = "nos";
+        if (!oneService) services[1u]["id"] = "nos_https";
+        conf["service"] = services;
+        root.write("/usr/zepa/etc/zeparelayd/zeparelayd.conf", conf.toStyledString());
+        return Ctl({"reload"});
+    }
+
     int StartDaemon() { return RunProgram({kDaemon, "--root", root.dir(), "--ca-file", server.caFile()}); }
 
     int Ctl(const std::vector<std::string>& args, std::string* out = nullptr, std::string* err = nullptr) {
@@ -146,6 +160,7 @@ protected:
     }
 
     zepatest::LocalServer server;
+    bool oneService = false;
 };
 
 // The control tool without a daemon: usage, help on every level, exit statuses.

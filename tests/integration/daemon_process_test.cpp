@@ -121,6 +121,20 @@ TEST_F(DaemonProcess, DebugDumpNeverWritesThroughALinkAtItsTemporaryName) {
     EXPECT_NE(0, lstat(dumpTmp.c_str(), &st)) << "the planted link is gone, nothing is left at the name";
 }
 
+TEST_F(DaemonProcess, ADumpNoQueryCollectsIsRemoved) {
+    ASSERT_EQ(0, StartDaemon());
+    ASSERT_TRUE(StatusHas("state: connected"));
+    const pid_t pid = DaemonPid();
+    // SIGUSR1 without a query, as when a query gave up before the dump came.
+    const std::string dump = root.path("/tmp/.zeparelayd." + std::to_string(pid) + ".debug");
+    ASSERT_EQ(0, kill(pid, SIGUSR1));
+    ASSERT_TRUE(WaitUntil([&] { return access(dump.c_str(), F_OK) == 0; }));
+    EXPECT_TRUE(WaitUntil([&] { return access(dump.c_str(), F_OK) != 0; }));
+    // Queries still get their answer.
+    Daemon::LibInit();
+    EXPECT_EQ(pid, Dump()["pid"].asInt());
+}
+
 TEST_F(DaemonProcess, ReloadAppliesANewLogLevel) {
     ASSERT_EQ(0, StartDaemon());
     ASSERT_TRUE(StatusHas("state: connected"));
@@ -174,7 +188,7 @@ TEST_F(DaemonProcess, ServerIdChangeSendsExactlyOneNotice) {
     ASSERT_TRUE(moved["ok"].asBool());
 
     const int regs = Requests("/Serv.php");
-    EXPECT_EQ(0, Ctl({"reload"}));
+    EXPECT_EQ(0, ReloadToRegisterAgain());
     std::string second;
     ASSERT_TRUE(WaitUntil([&] {
         Ctl({"server-id"}, &second);
@@ -186,7 +200,7 @@ TEST_F(DaemonProcess, ServerIdChangeSendsExactlyOneNotice) {
                             "relayservice:relayservice_serverid_change_msg\n"));
 
     // The same id again changes nothing: no further notice.
-    EXPECT_EQ(0, Ctl({"reload"}));
+    EXPECT_EQ(0, ReloadToRegisterAgain());
     ASSERT_TRUE(WaitUntil([&] { return Requests("/Serv.php") == regs + 2; }));
     ASSERT_TRUE(StatusHas("state: connected"));
     EXPECT_EQ(2, Notices());
@@ -281,7 +295,7 @@ TEST_F(DaemonProcess, MisshapenRegistrationAnswersDoNotKillTheDaemon) {
             pid = DaemonPid();
             started = true;
         } else {
-            ASSERT_EQ(0, Ctl({"reload"}));
+            ASSERT_EQ(0, ReloadToRegisterAgain());
         }
         // Handled: the server has answered and the daemon no longer waits for it.
         ASSERT_TRUE(WaitUntil([&] {

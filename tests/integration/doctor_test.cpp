@@ -193,12 +193,7 @@ TEST_F(Doctor, StatusFileTellsWhenResultsCameAndWhatIsNext) {
     plan["body"] = "busy";
     plan["count"] = 5;
     ASSERT_TRUE(server.scriptRaw(plan));
-    // A changed service list makes the reload register again.
-    Json::Value conf = zepatest::ParseJson(root.read("/usr/zepa/etc/zeparelayd/zeparelayd.conf"));
-    ASSERT_TRUE(conf.isObject());
-    conf["service"] = zepatest::ParseJson("[{\"id\": \"nos\"}]");
-    root.write("/usr/zepa/etc/zeparelayd/zeparelayd.conf", zepatest::ToJson(conf));
-    ASSERT_EQ(0, Ctl({"reload"}));
+    ASSERT_EQ(0, ReloadToRegisterAgain());
     ASSERT_TRUE(WaitUntil([&] { return StatusFile()["registration_retry_at"].isIntegral(); }));
     const Json::Value failed = StatusFile();
     EXPECT_EQ(3, failed["state"].asInt());

@@ -7,7 +7,10 @@
 #include <unistd.h>
 
 #include <chrono>
+#include <fstream>
 #include <functional>
+#include <iostream>
+#include <iterator>
 #include <sstream>
 #include <thread>
 
@@ -226,6 +229,166 @@ TEST_F(RelayDaemonTest, RefusedTunnelIsAnErrorAndIsRetriedAfterABackOff) {
     ASSERT_TRUE(WaitUntil([&] { return State() == 6; }, 30000)) << CtlStatus() << Log();
     EXPECT_EQ(0, StatusFile()["error"].asInt());
     EXPECT_EQ(0u, Page().find("200 "));
+}
+
+}  // namespace
+
+namespace {
+
+// Milliseconds from now until cond holds, -1 when it did not within maxMs.
+int64_t MsUntil(const std::function<bool()>& cond, int maxMs) {
+    const auto start = std::chrono::steady_clock::now();
+    const auto end = start + std::chrono::milliseconds(maxMs);
+    for (;;) {
+        if (cond()) {
+            return std::chrono::duration_cast<std::chrono::milliseconds>(std::chrono::steady_clock::now() -
+                                                                         start)
+                .count();
+        }
+        if (std::chrono::steady_clock::now() >= end) return -1;
+        std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    }
+}
+
+size_t Count(const std::string& text, const std::string& needle) {
+    size_t n = 0;
+    for (size_t at = text.find(needle); at != std::string::npos; at = text.find(needle, at + 1)) ++n;
+    return n;
+}
+
+TEST_F(RelayDaemonTest, SilentRelayEveryCommandIsAnsweredDuringTheStartAndStopLeavesNothing) {
+    ASSERT_TRUE(relay.Silence(true));
+    ASSERT_EQ(0, StartDaemon());
+    ASSERT_TRUE(WaitUntil([&] { return StatusFile()["tunnel"].isMember("starting"); }, 15000))
+        << CtlStatus() << Log();
+    const std::string user = StatusFile()["tunnel"]["relay_user"].asString();
+    ASSERT_FALSE(user.empty());
+    EXPECT_TRUE(root.exists("/tmp/.tunnel." + user));
+
+    for (int round = 0; round < 3; ++round) {
+        // The debug dump answers at once.
+        std::string out;
+        EXPECT_EQ(0, Ctl({"status", "--debug"}, &out)) << out;
+        EXPECT_NE(std::string::npos, out.find("\"starting\"")) << out;
+        // The alias exchange starts within a second.
+        const size_t aliasBefore = relay.server().requests("/alias_update.php").size();
+        ASSERT_EQ(0, Ctl({"update-alias"}, &out)) << out;
+        EXPECT_GE(
+            MsUntil([&] { return relay.server().requests("/alias_update.php").size() > aliasBefore; }, 1000),
+            0)
+            << "update-alias not started within 1 s";
+        // A reload is applied within a second; with nothing changed the
+        // start under way goes on.
+        const int vpnPid = StatusFile()["tunnel"]["pid"].asInt();
+        const size_t reloadsBefore = Count(Log(), "reload: nothing changed");
+        ASSERT_EQ(0, Ctl({"reload"}, &out)) << out;
+        EXPECT_GE(MsUntil([&] { return Count(Log(), "reload: nothing changed") > reloadsBefore; }, 1000), 0)
+            << "reload not applied within 1 s";
+        ASSERT_TRUE(WaitUntil([&] { return StatusFile()["tunnel"].isMember("starting"); }, 5000))
+            << CtlStatus();
+        if (vpnPid > 0 && StatusFile()["tunnel"]["starting"].asString() == "udp") {
+            EXPECT_EQ(vpnPid, StatusFile()["tunnel"]["pid"].asInt());
+        }
+        // No READY without a peer address.
+        EXPECT_NE(6, State());
+        EXPECT_NE("READY", StatusFile()["tunnel"]["status"].asString());
+        std::this_thread::sleep_for(std::chrono::milliseconds(500));
+    }
+    EXPECT_EQ(std::string::npos, CtlStatus().find("READY")) << CtlStatus();
+    EXPECT_EQ(std::string::npos, Log().find("tunnel up")) << Log();
+
+    // Stop during the start: no openvpn, pass file or tunnel info file stays.
+    std::string out;
+    EXPECT_EQ(0, Ctl({"stop"}, &out)) << out;
+    EXPECT_EQ(0, VpnClients());
+    EXPECT_FALSE(root.exists("/tmp/.tunnel." + user));
+    EXPECT_FALSE(root.exists("/tmp/.zepa_farlink_tunnel_info"));
+    EXPECT_EQ(8, State());
+}
+
+}  // namespace
+
+namespace {
+
+TEST_F(RelayDaemonTest, KillNineWithTheTunnelUpThenStartEndsTheOldOpenvpnAndComesBack) {
+    ASSERT_EQ(0, StartDaemon());
+    ASSERT_TRUE(StatusHas("tunnel: READY")) << CtlStatus() << Log();
+    const pid_t daemon = DaemonPid();
+    const int oldVpn = StatusFile()["tunnel"]["pid"].asInt();
+    ASSERT_GT(oldVpn, 0);
+    ASSERT_EQ(0, kill(daemon, SIGKILL));
+    ASSERT_TRUE(WaitUntil([&] { return kill(daemon, 0) != 0; }, 5000));
+    // Left behind: the openvpn, still connected, and a status saying READY.
+    ASSERT_EQ(1, VpnClients());
+    ASSERT_EQ(6, State());
+
+    const auto start = std::chrono::steady_clock::now();
+    ASSERT_EQ(0, StartDaemon());
+    ASSERT_TRUE(WaitUntil([&] { return State() == 6 && StatusFile()["pid"].asInt() != daemon; }, 20000))
+        << CtlStatus() << Log();
+    ASSERT_TRUE(WaitUntil([&] { return Page().find("200 ") == 0; }, 10000)) << Page();
+    const auto ms =
+        std::chrono::duration_cast<std::chrono::milliseconds>(std::chrono::steady_clock::now() - start)
+            .count();
+    std::cout << "kill -9 with the tunnel up: READY and the page " << ms << " ms after the start\n";
+    EXPECT_EQ(1, VpnClients());
+    EXPECT_NE(oldVpn, StatusFile()["tunnel"]["pid"].asInt());
+    // The old openvpn is gone (its number may have been reused by now).
+    std::ifstream oldCommand("/proc/" + std::to_string(oldVpn) + "/cmdline", std::ios::binary);
+    const std::string oldLine((std::istreambuf_iterator<char>(oldCommand)), std::istreambuf_iterator<char>());
+    EXPECT_EQ(std::string::npos, oldLine.find(root.dir())) << oldLine;
+    EXPECT_NE(std::string::npos,
+              Log().find("ending openvpn " + std::to_string(oldVpn) + " left by an earlier run"))
+        << Log();
+    const std::string listing = zepatest::ListDir(root.path("/tmp"));
+    EXPECT_EQ(std::string::npos, listing.find(".tunnel.")) << listing;
+}
+
+TEST_F(RelayDaemonTest, KillNineDuringTheStartLeavesNothingAfterTheNextStart) {
+    ASSERT_TRUE(relay.Silence(true));
+    ASSERT_EQ(0, StartDaemon());
+    ASSERT_TRUE(WaitUntil([&] { return StatusFile()["tunnel"]["pid"].asInt() > 0; }, 15000)) << CtlStatus();
+    const std::string user = StatusFile()["tunnel"]["relay_user"].asString();
+    ASSERT_TRUE(root.exists("/tmp/.tunnel." + user));
+    const pid_t daemon = DaemonPid();
+    ASSERT_EQ(0, kill(daemon, SIGKILL));
+    ASSERT_TRUE(WaitUntil([&] { return kill(daemon, 0) != 0; }, 5000));
+    ASSERT_TRUE(relay.Silence(false));
+
+    ASSERT_EQ(0, StartDaemon());
+    ASSERT_TRUE(WaitUntil([&] { return State() == 6 && StatusFile()["pid"].asInt() != daemon; }, 30000))
+        << CtlStatus() << Log();
+    EXPECT_EQ(1, VpnClients());
+    EXPECT_FALSE(root.exists("/tmp/.tunnel." + user));
+    EXPECT_NE(std::string::npos, Log().find("left by an earlier run")) << Log();
+}
+
+}  // namespace
+
+namespace {
+
+TEST_F(RelayDaemonTest, ReloadWithNothingChangedKeepsTheTunnelRegistrationAndAlias) {
+    ASSERT_EQ(0, StartDaemon());
+    ASSERT_TRUE(StatusHas("tunnel: READY")) << CtlStatus() << Log();
+    ASSERT_TRUE(StatusHas("alias_status: good")) << CtlStatus();
+    const int vpnPid = StatusFile()["tunnel"]["pid"].asInt();
+    const size_t registrations = relay.server().requests("/Serv.php").size();
+    const size_t aliasUpdates = relay.server().requests("/alias_update.php").size();
+
+    std::string out;
+    ASSERT_EQ(0, Ctl({"reload"}, &out)) << out;
+    ASSERT_TRUE(WaitUntil([&] { return Log().find("reload: nothing changed") != std::string::npos; }, 5000))
+        << Log();
+    // The page stays reachable all the while.
+    for (int i = 0; i < 5; ++i) {
+        EXPECT_EQ(0u, Page().find("200 "));
+        std::this_thread::sleep_for(std::chrono::milliseconds(200));
+    }
+    EXPECT_EQ(6, State());
+    EXPECT_EQ(vpnPid, StatusFile()["tunnel"]["pid"].asInt());
+    EXPECT_EQ(registrations, relay.server().requests("/Serv.php").size());
+    EXPECT_EQ(aliasUpdates, relay.server().requests("/alias_update.php").size());
+    EXPECT_EQ(1, VpnClients());
 }
 
 }  // namespace

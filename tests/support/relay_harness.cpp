@@ -174,6 +174,12 @@ bool RelayHarness::BlockUdp(bool on) {
     return Admin("POST", "/relay/admin/block_udp", body)["ok"].asBool();
 }
 
+bool RelayHarness::Silence(bool on) {
+    Json::Value body;
+    body["on"] = on;
+    return Admin("POST", "/relay/admin/silence", body)["ok"].asBool();
+}
+
 bool RelayHarness::Vpn(const std::string& action) {
     Json::Value body;
     body["action"] = action;

@@ -39,6 +39,8 @@ public:
     // the proxy to that user's tunnel. The Tunnel section's JSON.
     Json::Value Grant(const std::string& user, const std::string& alias);
     bool BlockUdp(bool on);
+    // The VPN servers' answers dropped: a relay that stays silent.
+    bool Silence(bool on);
     // "stop" or "start" the VPN servers.
     bool Vpn(const std::string& action);
     Json::Value Admin(const std::string& method, const std::string& path,

@@ -2,8 +2,15 @@
 // the state, its back-off policy against a clock the test moves by hand, and
 // an incomplete tunnel answer.
 #include <gtest/gtest.h>
+#include <signal.h>
 #include <stdlib.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
 #include <unistd.h>
+
+#include <fstream>
+#include <functional>
+#include <sstream>
 
 #include <string>
 #include <utility>
@@ -198,6 +205,171 @@ TEST_F(TunnelCycleTest, PasswordIsNeverShown) {
     cycle.Stop(false);
     EXPECT_FALSE(cycle.HasTunnel());
     EXPECT_EQ(-1, loop.TimerRemaining("tunnel"));
+}
+
+// A start driven by the loop, against a stand-in openvpn below the root that
+// does what the test file "etc/openvpn.mode" says: "up" publishes a peer
+// address (as the up script does), "die" ends at once, anything else stays
+// silent. The daemon would pass on SIGUSR2 and SIGCHLD; here the test does.
+class TunnelStartTest : public TunnelCycleTest {
+protected:
+    void SetUp() override {
+        TunnelCycleTest::SetUp();
+        for (const char* dir : {"/usr", "/usr/sbin", "/tmp", "/etc", "/var", "/var/log"}) {
+            ASSERT_EQ(0, mkdir((root + dir).c_str(), 0755));
+        }
+        Write("/usr/sbin/openvpn",
+              "#!/bin/sh\n"
+              "root=$(cd \"$(dirname \"$0\")/../..\" && pwd)\n"
+              "proto=''; prev=''\n"
+              "for a do [ \"$prev\" = --proto ] && proto=$a; prev=$a; done\n"
+              "echo \"$proto\" >>\"$root/var/log/openvpn.calls\"\n"
+              "mode=$(cat \"$root/etc/openvpn.mode\" 2>/dev/null)\n"
+              "case \"$mode\" in\n"
+              "  up) printf 'peer_ip=\"10.214.0.1\"\\n' >\"$root/tmp/.zepa_farlink_tunnel_info\" ;;\n"
+              "  die) exit 1 ;;\n"
+              "esac\n"
+              "exec sleep 30\n");
+        ASSERT_EQ(0, chmod((root + "/usr/sbin/openvpn").c_str(), 0755));
+        cycle.SetUpWaitMs(300);
+    }
+
+    void Write(const std::string& path, const std::string& text) {
+        std::ofstream out(root + path);
+        out << text;
+    }
+    bool Exists(const std::string& path) const { return access((root + path).c_str(), F_OK) == 0; }
+    std::string Read(const std::string& path) const {
+        std::ifstream in(root + path);
+        std::stringstream text;
+        text << in.rdbuf();
+        return text.str();
+    }
+
+    void AskForTunnel() {
+        Json::Value answer;
+        answer["connect"] = "tunnel";
+        answer["tunnel"]["relay_ip"] = "10.213.0.1";
+        answer["tunnel"]["relay_user"] = "zr1";
+        answer["tunnel"]["relay_pass"] = "s3cret-pass";
+        cycle.OnRegistered(answer);
+    }
+
+    // Runs the loop until cond holds (checked every 20 ms, after passing on
+    // what the daemon would: SIGCHLD always, SIGUSR2 once the up script's
+    // file is there) or maxMs pass; whether it held.
+    bool RunUntil(const std::function<bool()>& cond, int64_t maxMs) {
+        bool held = false;
+        const int64_t end = monotonic.NowMs() + maxMs;
+        std::function<void()> tick = [&] {
+            cycle.OnChildExited();
+            if (Exists("/tmp/.zepa_farlink_tunnel_info") && cycle.Starting()) cycle.OnUpSignal();
+            if (cond()) {
+                held = true;
+                loop.Stop();
+            } else if (monotonic.NowMs() >= end) {
+                loop.Stop();
+            } else {
+                loop.SetTimer("test_tick", 20, tick);
+            }
+        };
+        loop.SetTimer("test_tick", 0, tick);
+        EXPECT_TRUE(loop.Run());
+        loop.CancelTimer("test_tick");
+        return held;
+    }
+
+    bool SawState(RELAYD_STATE state) const {
+        for (const auto& s : states) {
+            if (s.first == state) return true;
+        }
+        return false;
+    }
+    int TunnelPid() const { return cycle.Status()["tunnel"]["pid"].asInt(); }
+};
+
+TEST_F(TunnelStartTest, PeerAddressFromTheUpScriptMakesItReadyAndThePassFileGoes) {
+    Write("/etc/openvpn.mode", "up");
+    AskForTunnel();
+    ASSERT_TRUE(RunUntil([&] { return cycle.IsUp(); }, 5000));
+    EXPECT_EQ(RELAYD_STATE_CONNECTED_ALT, states.back().first);
+    const Json::Value status = cycle.Status();
+    EXPECT_EQ("READY", status["tunnel"]["status"].asString());
+    EXPECT_EQ("10.214.0.1", status["tunnel"]["peer_ip"].asString());
+    EXPECT_EQ("udp\n", Read("/var/log/openvpn.calls"));
+    EXPECT_FALSE(Exists("/tmp/.tunnel.zr1"));
+    const int pid = TunnelPid();
+    ASSERT_GT(pid, 0);
+    EXPECT_EQ(0, kill(pid, 0));
+
+    // The down script takes the peer address away while openvpn reconnects:
+    // no longer READY, until the up script reports again.
+    ASSERT_EQ(0, unlink((root + "/tmp/.zepa_farlink_tunnel_info").c_str()));
+    ASSERT_TRUE(RunUntil([&] { return states.back().first == RELAYD_STATE_CONNECTED; }, 3000));
+    EXPECT_EQ(RELAYD_ERR_NETWORK, states.back().second);
+    EXPECT_FALSE(cycle.IsUp());
+    EXPECT_EQ("NONE", cycle.Status()["tunnel"]["status"].asString());
+    Write("/tmp/.zepa_farlink_tunnel_info", "peer_ip=\"10.214.0.1\"\n");
+    cycle.OnUpSignal();
+    EXPECT_TRUE(cycle.IsUp());
+    EXPECT_EQ(RELAYD_STATE_CONNECTED_ALT, states.back().first);
+
+    cycle.Stop(true);
+    EXPECT_NE(0, kill(pid, 0));
+    EXPECT_FALSE(Exists("/tmp/.zepa_farlink_tunnel_info"));
+}
+
+TEST_F(TunnelStartTest, SilentChildIsNeverReadyAndIsEndedAfterTheWait) {
+    Write("/etc/openvpn.mode", "silent");
+    AskForTunnel();
+    // The pass file exists while a start runs, and only then.
+    ASSERT_TRUE(RunUntil([&] { return Exists("/tmp/.tunnel.zr1"); }, 2000));
+    // An up signal without a peer address changes nothing.
+    cycle.OnUpSignal();
+    EXPECT_FALSE(cycle.IsUp());
+    ASSERT_TRUE(RunUntil([&] { return SawState(RELAYD_STATE_LOGIN); }, 5000));
+    EXPECT_FALSE(SawState(RELAYD_STATE_CONNECTED_ALT));
+    EXPECT_EQ(RELAYD_ERR_NETWORK, states.back().second);
+    // UDP first, then TCP, each ended when the wait ran out.
+    EXPECT_EQ("udp\ntcp-client\n", Read("/var/log/openvpn.calls"));
+    EXPECT_EQ("FAILED", cycle.Status()["tunnel"]["status"].asString());
+    EXPECT_FALSE(Exists("/tmp/.tunnel.zr1"));
+    EXPECT_GT(loop.TimerRemaining("tunnel_retry"), 0);
+    ASSERT_TRUE(RunUntil([&] { return cycle.Ending() == 0; }, 4000));
+    EXPECT_EQ(-1, waitpid(-1, nullptr, WNOHANG));
+}
+
+TEST_F(TunnelStartTest, ChildThatDiesFallsBackToTcpThenFails) {
+    Write("/etc/openvpn.mode", "die");
+    AskForTunnel();
+    ASSERT_TRUE(RunUntil([&] { return SawState(RELAYD_STATE_LOGIN); }, 5000));
+    EXPECT_EQ("udp\ntcp-client\n", Read("/var/log/openvpn.calls"));
+    EXPECT_FALSE(SawState(RELAYD_STATE_CONNECTED_ALT));
+    EXPECT_FALSE(Exists("/tmp/.tunnel.zr1"));
+}
+
+TEST_F(TunnelStartTest, StopDuringTheStartLeavesNoChildAndNoPassFile) {
+    Write("/etc/openvpn.mode", "silent");
+    AskForTunnel();
+    ASSERT_TRUE(RunUntil([&] { return TunnelPid() > 0 && Exists("/var/log/openvpn.calls"); }, 2000));
+    const int pid = TunnelPid();
+    cycle.Stop(true);
+    EXPECT_NE(0, kill(pid, 0));
+    EXPECT_FALSE(Exists("/tmp/.tunnel.zr1"));
+    EXPECT_FALSE(cycle.HasTunnel());
+    EXPECT_EQ(0u, cycle.Ending());
+    EXPECT_EQ(-1, loop.TimerRemaining("tunnel_up_wait"));
+}
+
+TEST_F(TunnelStartTest, HeartbeatWithTheSameAnswerKeepsTheStartUnderWay) {
+    Write("/etc/openvpn.mode", "silent");
+    AskForTunnel();
+    ASSERT_TRUE(RunUntil([&] { return TunnelPid() > 0; }, 2000));
+    const int pid = TunnelPid();
+    AskForTunnel();
+    EXPECT_TRUE(cycle.Starting());
+    EXPECT_EQ(pid, TunnelPid());
+    EXPECT_EQ(0, kill(pid, 0));
 }
 
 }  // namespace

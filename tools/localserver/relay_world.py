@@ -115,6 +115,7 @@ class RelayWorld:
         self.servers = {}
         self.web = None
         self.udp_blocked = False
+        self.silenced = False
         self.created = []
 
     # ---- set-up and teardown -------------------------------------------
@@ -322,6 +323,17 @@ class RelayWorld:
             elif not on and self.udp_blocked:
                 _run("ip", "-n", self.appliance_ns, "rule", "del", "pref", "10")
             self.udp_blocked = on
+
+    def silence(self, on):
+        """Drops every answer of the relay's VPN servers (UDP and TCP, from
+        the VPN port): the appliance's packets arrive, nothing comes back, as
+        with a relay that hangs or a path that loses the return traffic."""
+        with self.lock:
+            if on and not self.silenced:
+                _run("ip", "-n", self.relay_ns, "rule", "add", "sport", str(VPN_PORT), "blackhole", "pref", "11")
+            elif not on and self.silenced:
+                _run("ip", "-n", self.relay_ns, "rule", "del", "pref", "11")
+            self.silenced = on
 
     def info(self):
         return {"ip": RELAY_IP, "port": VPN_PORT, "relay_netns": self.relay_ns,

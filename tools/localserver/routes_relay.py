@@ -49,6 +49,7 @@ Admin calls for tests and demos:
   POST /relay/admin/grant {"alias", "direct": true}  the alias leads to the appliance's own
                                                    address, no tunnel (for comparisons)
   POST /relay/admin/block_udp {"on": bool}         UDP to the VPN port dropped
+  POST /relay/admin/silence {"on": bool}           the VPN servers' answers dropped (silent relay)
   POST /relay/admin/refuse {"on": bool}            the VPN servers refuse every password
   POST /relay/admin/vpn {"action": "stop" | "start"}   the VPN servers
   GET  /relay/admin/tunnels                        -> {"tunnels": {user: address}, "aliases": {...}}
@@ -277,6 +278,12 @@ def register(server):
         server.relay.block_udp(bool(req.json().get("on")))
         return core.json_reply({"ok": True})
 
+    def silence(req):
+        if server.relay is None:
+            return needs_relay()
+        server.relay.silence(bool(req.json().get("on")))
+        return core.json_reply({"ok": True})
+
     def refuse(req):
         if server.relay is None:
             return needs_relay()
@@ -310,6 +317,7 @@ def register(server):
     server.route("/relay/admin/block_udp", block_udp, methods=["POST"])
     server.route("/relay/admin/vpn", vpn, methods=["POST"])
     server.route("/relay/admin/refuse", refuse, methods=["POST"])
+    server.route("/relay/admin/silence", silence, methods=["POST"])
     server.route("/relay/admin/tunnels", tunnels, methods=["GET"])
     server.route(PAGE, serv, methods=["POST"])
     server.route("/relay/admin/reassign", reassign, methods=["POST"])

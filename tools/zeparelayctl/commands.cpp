@@ -82,22 +82,34 @@ struct StatusView {
     Json::Value file;  // the status file while the daemon runs, else null
 };
 
+// The status file is read once; its words are those of the library's word
+// form (Daemon::GetStatus without a service id).
 StatusView ReadStatus() {
     StatusView view;
     Json::Value file;
     const int probe = Daemon::GetStatus(file);
-    if (!Daemon::GetStatus(view.serverId, view.state, view.error, nullptr)) {
+    if (probe != RELAYD_RESULT_OK && probe != RELAYD_RESULT_NOT_RUNNING) {
         view.result = EXIT_BROKEN_STATUS;
         return view;
     }
+    if (file.isObject() && file["serverID"].isString()) view.serverId = file["serverID"].asString();
+    int state = 1;
+    int error = 0;
+    if (probe == RELAYD_RESULT_OK) {
+        if (file["state"].isInt()) state = file["state"].asInt();
+        if (file["error"].isInt()) error = file["error"].asInt();
+    }
+    view.state = GetStateStr(static_cast<RELAYD_STATE>(state));
+    view.error = GetErrorStr(static_cast<RELAYD_RET>(error));
     view.result = view.state == "not_running" ? EXIT_NOT_RUNNING : EXIT_OK;
-    if (view.result == EXIT_OK && probe == RELAYD_RESULT_OK) view.file = file;
-    // The alias the configuration names; when that file is broken, the one
-    // the daemon last reported.
-    const ConfigCheck check = CheckConfigFile(ConfPath());
-    if (check.ok()) {
-        RelaydConf conf(ConfPath().c_str());
-        view.aliasName = conf.alias.GetAliasName();
+    if (view.result == EXIT_OK) view.file = file;
+    // The alias the configuration names (its alias section only); when that
+    // file is broken, the one the daemon last reported.
+    Json::Value conf;
+    if (CheckConfigFile(ConfPath()).ok() && RelaydConf::ReadJsonFile(ConfPath(), conf) && conf.isObject()) {
+        AliasConf alias;
+        if (conf.isMember("server_alias")) alias.Overwrite(conf["server_alias"]);
+        view.aliasName = alias.GetAliasName();
     } else if (file.isObject() && file["alias"].isString()) {
         view.aliasName = file["alias"].asString();
     }

@@ -36,8 +36,9 @@ std::string OutcomeWord(bool answered, ALIAS_RET ret, const Request& req) {
 
 }  // namespace
 
-AliasCycle::AliasCycle(RelaydConf& conf, EventLoop& loop, const Clock& clock, Hooks hooks)
-    : _conf(conf), _loop(loop), _policy(clock, [] { return random(); }), _hooks(std::move(hooks)) {}
+AliasCycle::AliasCycle(RelaydConf& conf, EventLoop& loop, const Clock& clock, Hooks hooks,
+                       RandomSource random)
+    : _conf(conf), _loop(loop), _policy(clock, std::move(random)), _hooks(std::move(hooks)) {}
 
 void AliasCycle::Follow(const AliasStep& step, const char* why) {
     _loop.CancelTimer(TAG);

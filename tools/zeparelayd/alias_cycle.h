@@ -28,7 +28,8 @@ public:
         std::function<void()> changed;
     };
 
-    AliasCycle(ZEPA::Relay::RelaydConf& conf, EventLoop& loop, const Clock& clock, Hooks hooks);
+    AliasCycle(ZEPA::Relay::RelaydConf& conf, EventLoop& loop, const Clock& clock, Hooks hooks,
+               RandomSource random = SystemRandom());
 
     void OnRegistered();
     // Someone asked for an update now; runs even after a stop-class answer.
@@ -43,6 +44,8 @@ public:
     void DeleteOnDisable();
     // An exchange is running or scheduled (a heartbeat leaves it alone).
     bool Pending() const;
+    // A stop-class answer halted the automatic exchanges until a reload.
+    bool Halted() const { return _policy.Halted(); }
 
     // The word of the last outcome, as the status shows it.
     const std::string& Word() const { return _word; }

@@ -2,7 +2,9 @@
 
 #include <fcntl.h>
 #include <signal.h>
+#include <sys/file.h>
 #include <sys/stat.h>
+#include <time.h>
 #include <unistd.h>
 
 #include <atomic>
@@ -19,6 +21,9 @@ char gTmp[1100];
 // Swapped whole by the loop; the handler only ever reads the current one, and
 // the loop frees a text only after it has been swapped out.
 std::atomic<const std::string*> gText{nullptr};
+// Dumps written so far, and as many as the loop has seen.
+std::atomic<unsigned> gWrites{0};
+unsigned gWritesSeen = 0;
 
 // The temporary name is predictable and /tmp is everyone's: create it
 // exclusively and never through a link. Whatever stands there (a link planted
@@ -73,7 +78,13 @@ void OnDumpSignal(int) {
             }
             fchmod(fd, 0644);
             close(fd);
-            if (!inPlace && (!ok || rename(gTmp, gPath) != 0)) unlink(gTmp);
+            if (!ok) {
+                if (!inPlace) unlink(gTmp);
+            } else if (!inPlace && rename(gTmp, gPath) != 0) {
+                unlink(gTmp);
+            } else {
+                gWrites.fetch_add(1);
+            }
         }
     }
     errno = savedErrno;
@@ -101,6 +112,38 @@ void PublishDebugDump(const std::string& text) {
 void RemoveDebugDump() {
     signal(SIGUSR1, SIG_IGN);
     delete gText.exchange(nullptr);
+}
+
+bool TakeDumpWritten() {
+    const unsigned writes = gWrites.load();
+    if (writes == gWritesSeen) return false;
+    gWritesSeen = writes;
+    return true;
+}
+
+int RemoveGivenUpDump(const std::string& path, int minAgeMs) {
+    const int fd = open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC | O_NOCTTY);
+    if (fd < 0) return errno == ENOENT ? 0 : -1;
+    struct stat st;
+    int result = -1;
+    if (fstat(fd, &st) == 0 && S_ISREG(st.st_mode)) {
+        // A query that runs holds the file's lock; it deletes the file itself.
+        if (flock(fd, LOCK_EX | LOCK_NB) != 0) {
+            result = 1;
+        } else {
+            struct timespec now;
+            clock_gettime(CLOCK_REALTIME, &now);
+            const long long ageMs = (static_cast<long long>(now.tv_sec) - st.st_mtim.tv_sec) * 1000 +
+                                    (now.tv_nsec - st.st_mtim.tv_nsec) / 1000000;
+            if (ageMs < minAgeMs) {
+                result = 1;
+            } else {
+                result = unlink(path.c_str()) == 0 ? 0 : -1;
+            }
+        }
+    }
+    close(fd);
+    return result;
 }
 
 }  // namespace zeparelayd

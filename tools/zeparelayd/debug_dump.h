@@ -19,6 +19,15 @@ void PublishDebugDump(const std::string& text);
 // On the way out: SIGUSR1 is ignored from now on.
 void RemoveDebugDump();
 
+// Whether the handler has written a dump since the last call (loop only).
+bool TakeDumpWritten();
+// A query that gave up (after its few milliseconds) has deleted the file
+// already when the dump arrives, and nobody would remove it. So the loop
+// removes a dump at path once it is minAgeMs old and no query holds its
+// lock. 0 removed or none there, 1 still in use or too young (try again
+// later), -1 not a regular file or not removable (left alone).
+int RemoveGivenUpDump(const std::string& path, int minAgeMs);
+
 }  // namespace zeparelayd
 
 #endif

@@ -61,6 +61,7 @@ public:
     // Runs until Stop(); false when the loop could not wait.
     bool Run();
     void Stop() { _running = false; }
+    bool Running() const { return _running; }
 
 private:
     struct Timer {

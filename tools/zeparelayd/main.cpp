@@ -29,6 +29,7 @@
 #include "exit_codes.h"
 #include "log.h"
 #include "log_file_check.h"
+#include "recovery.h"
 #include "relay_daemon.h"
 
 using namespace ZEPA::Relay;
@@ -138,18 +139,104 @@ void RemoveStalePidFile() {
     }
 }
 
+// --root and --ca-file: absolute, the system root taken, the extra CA trusted.
+bool ApplyPathOptions(Options& opt) {
+    if (!Absolute("--root", opt.root) || !Absolute("--ca-file", opt.caFile)) return false;
+    if (!opt.root.empty() && ZEPASysRootSet(opt.root.c_str()) != 0) {
+        fprintf(stderr, "zeparelayd: --root %s: not usable as the system root\n", opt.root.c_str());
+        return false;
+    }
+    if (!opt.caFile.empty()) Request::SetExtraCaFile(opt.caFile);
+    return true;
+}
+
+// A broken file would be set aside as ".bad" by the library and the daemon
+// would run on defaults: the operator fixes it first.
+bool ConfigurationUsable(const std::string& confPath) {
+    if (access(confPath.c_str(), F_OK) != 0) return true;
+    const ConfigCheck check = CheckConfigFile(confPath);
+    if (check.ok()) return true;
+    for (const std::string& e : check.errors) fprintf(stderr, "zeparelayd: %s\n", e.c_str());
+    fprintf(stderr, "zeparelayd: not started: fix the configuration (zeparelayd --check-config)\n");
+    return false;
+}
+
+// Log settings before forking, so that the child's standard error points at
+// the configured file from its first line on. The child opens that file after
+// the fork, too late to refuse the start: a link or FIFO there is refused
+// here. EXIT_OK, or the exit status.
+int ApplyEarlyLogSettings(const std::string& confPath, bool foreground) {
+    RelaydConf early(confPath.c_str());
+    zeparelayd::ApplyLogSettings(early);
+    std::string why;
+    if (!foreground && !LogFileUsable(Daemon::_strLogFile, why)) {
+        fprintf(stderr, "zeparelayd: not started: the log file %s %s; remove it or choose another\n",
+                Daemon::_strLogFile.c_str(), why.c_str());
+        return EXIT_CONFIG;
+    }
+    return EXIT_OK;
+}
+
+// Tools signal the daemon as soon as its PID file exists. So the signals are
+// held back from before the PID file is written, and their handlers
+// (inherited across the fork) exist by then too; they are let through once
+// the loop can answer them. EXIT_OK, or the exit status.
+int HoldSignals(sigset_t& previous) {
+    sigset_t held;
+    sigemptyset(&held);
+    for (int sig : {SIGINT, SIGTERM, SIGQUIT, SIGPIPE, SIGHUP, SIGCHLD, SIGALRM, SIGUSR1, SIGUSR2,
+                    SIGRTMIN + 1, SIGRTMIN + 5, zeparelayd::ReopenLogSignal()}) {
+        sigaddset(&held, sig);
+    }
+    sigprocmask(SIG_BLOCK, &held, &previous);
+    if (Daemon::InitSignalHandler() < 0 || daemon_signal_install(zeparelayd::ReopenLogSignal()) < 0) {
+        fprintf(stderr, "zeparelayd: cannot install the signal handlers\n");
+        return EXIT_NO_LOOP;
+    }
+    return EXIT_OK;
+}
+
+// The fork (unless in the foreground) and the PID file. EXIT_OK in the
+// daemon, or the exit status.
+int BecomeDaemon(bool foreground) {
+    if (Daemon::Init(!foreground)) return EXIT_OK;
+    if (DaemonFromPidFile().pid > 0) {
+        fprintf(stderr, "zeparelayd: not started: a zeparelayd already runs on the PID file %s\n",
+                Daemon::GetPidFile());
+        return EXIT_ALREADY_RUNNING;
+    }
+    fprintf(stderr, "zeparelayd: not started: cannot create the PID file %s\n", Daemon::GetPidFile());
+    return EXIT_NO_PID_FILE;
+}
+
+// The loop until a stop signal; the final status written. The exit status.
+int RunLoop(const std::string& confPath, const sigset_t& previous) {
+    zeparelayd::MonotonicClock clock;
+    zeparelayd::EventLoop loop(clock);
+    zeparelayd::RelayDaemon relay(confPath, loop, clock);
+    relay.ApplyLogSettings();
+    if (!loop.IsReady()) {
+        RLOG(LOG_ERR, "cannot set up the event loop");
+        return EXIT_NO_LOOP;
+    }
+    loop.OnSignal([&relay](int sig) { relay.HandleSignal(sig); });
+    loop.OnIdle([&relay] { relay.Idle(); });
+    // Before any tunnel: never two openvpn for one appliance.
+    zeparelayd::RemoveLeftovers();
+    const bool started = relay.Start();
+    sigprocmask(SIG_SETMASK, &previous, nullptr);
+    const int status = started && loop.Run() ? EXIT_OK : EXIT_NO_LOOP;
+    relay.Shutdown();
+    return status;
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
     Options opt;
     const int parsed = ParseOptions(argc, argv, opt);
     if (parsed != EXIT_OK) return parsed < 0 ? EXIT_OK : parsed;
-    if (!Absolute("--root", opt.root) || !Absolute("--ca-file", opt.caFile)) return EXIT_USAGE;
-    if (!opt.root.empty() && ZEPASysRootSet(opt.root.c_str()) != 0) {
-        fprintf(stderr, "zeparelayd: --root %s: not usable as the system root\n", opt.root.c_str());
-        return EXIT_USAGE;
-    }
-    if (!opt.caFile.empty()) Request::SetExtraCaFile(opt.caFile);
+    if (!ApplyPathOptions(opt)) return EXIT_USAGE;
 
     Daemon::SetName(argv[0]);
     const std::string confPath = Daemon::GetConfPath();
@@ -159,75 +246,18 @@ int main(int argc, char** argv) {
                    ? EXIT_OK
                    : EXIT_CONFIG;
     }
-    // A broken file would be set aside as ".bad" by the library and the
-    // daemon would run on defaults: the operator fixes it first.
-    if (access(confPath.c_str(), F_OK) == 0) {
-        const ConfigCheck check = CheckConfigFile(confPath);
-        if (!check.ok()) {
-            for (const std::string& e : check.errors) fprintf(stderr, "zeparelayd: %s\n", e.c_str());
-            fprintf(stderr, "zeparelayd: not started: fix the configuration (zeparelayd --check-config)\n");
-            return EXIT_CONFIG;
-        }
-    }
+    if (!ConfigurationUsable(confPath)) return EXIT_CONFIG;
     RemoveStalePidFile();
-    {
-        // Log settings before forking, so that the child's standard error
-        // points at the configured file from its first line on.
-        RelaydConf early(confPath.c_str());
-        zeparelayd::ApplyLogSettings(early);
-    }
-    // The child opens the log file after the fork, too late to refuse the start.
-    std::string why;
-    if (!opt.foreground && !LogFileUsable(Daemon::_strLogFile, why)) {
-        fprintf(stderr, "zeparelayd: not started: the log file %s %s; remove it or choose another\n",
-                Daemon::_strLogFile.c_str(), why.c_str());
-        return EXIT_CONFIG;
-    }
-    // Tools signal the daemon as soon as its PID file exists. So the signals
-    // are held back from before the PID file is written, and their handlers
-    // (inherited across the fork) exist by then too; they are let through
-    // once the loop can answer them.
-    sigset_t held;
-    sigemptyset(&held);
-    for (int sig : {SIGINT, SIGTERM, SIGQUIT, SIGPIPE, SIGHUP, SIGCHLD, SIGALRM, SIGUSR1, SIGUSR2,
-                    SIGRTMIN + 1, SIGRTMIN + 5, zeparelayd::ReopenLogSignal()}) {
-        sigaddset(&held, sig);
-    }
+    int status = ApplyEarlyLogSettings(confPath, opt.foreground);
+    if (status != EXIT_OK) return status;
     sigset_t previous;
-    sigprocmask(SIG_BLOCK, &held, &previous);
-    if (Daemon::InitSignalHandler() < 0 || daemon_signal_install(zeparelayd::ReopenLogSignal()) < 0) {
-        fprintf(stderr, "zeparelayd: cannot install the signal handlers\n");
-        return EXIT_NO_LOOP;
-    }
-    if (!Daemon::Init(!opt.foreground)) {
-        if (DaemonFromPidFile().pid > 0) {
-            fprintf(stderr, "zeparelayd: not started: a zeparelayd already runs on the PID file %s\n",
-                    Daemon::GetPidFile());
-            return EXIT_ALREADY_RUNNING;
-        }
-        fprintf(stderr, "zeparelayd: not started: cannot create the PID file %s\n", Daemon::GetPidFile());
-        return EXIT_NO_PID_FILE;
-    }
+    status = HoldSignals(previous);
+    if (status != EXIT_OK) return status;
+    status = BecomeDaemon(opt.foreground);
+    if (status != EXIT_OK) return status;
 
     curl_global_init(CURL_GLOBAL_DEFAULT);
-    int status = 0;
-    {
-        zeparelayd::MonotonicClock clock;
-        zeparelayd::EventLoop loop(clock);
-        zeparelayd::RelayDaemon relay(confPath, loop, clock);
-        relay.ApplyLogSettings();
-        if (!loop.IsReady()) {
-            RLOG(LOG_ERR, "cannot set up the event loop");
-            status = EXIT_NO_LOOP;
-        } else {
-            loop.OnSignal([&relay](int sig) { relay.HandleSignal(sig); });
-            loop.OnIdle([&relay] { relay.Idle(); });
-            const bool started = relay.Start();
-            sigprocmask(SIG_SETMASK, &previous, nullptr);
-            if (!started || !loop.Run()) status = EXIT_NO_LOOP;
-            relay.Shutdown();
-        }
-    }
+    status = RunLoop(confPath, previous);
     daemon_signal_done();
     daemon_pid_file_remove();
     curl_global_cleanup();

@@ -17,10 +17,11 @@ const char TAG[] = "register";
 
 }  // namespace
 
-RegistrationCycle::RegistrationCycle(RelaydConf& conf, EventLoop& loop, const Clock& clock, Hooks hooks)
+RegistrationCycle::RegistrationCycle(RelaydConf& conf, EventLoop& loop, const Clock& clock, Hooks hooks,
+                                     RandomSource random)
     : _conf(conf),
       _loop(loop),
-      _policy(clock, [] { return random(); }),
+      _policy(clock, std::move(random)),
       _hooks(std::move(hooks)),
       _error(RELAYD_SUCCESS) {}
 

@@ -36,7 +36,8 @@ public:
         std::function<void()> disabled;
     };
 
-    RegistrationCycle(ZEPA::Relay::RelaydConf& conf, EventLoop& loop, const Clock& clock, Hooks hooks);
+    RegistrationCycle(ZEPA::Relay::RelaydConf& conf, EventLoop& loop, const Clock& clock, Hooks hooks,
+                      RandomSource random = SystemRandom());
 
     // Registers now (or idles when the relay is switched off). keepState: a
     // heartbeat while registered, the state stays as it is meanwhile.

@@ -19,7 +19,8 @@ using namespace ZEPA::Relay;
 
 namespace zeparelayd {
 
-RelayDaemon::RelayDaemon(const std::string& confPath, EventLoop& loop, const Clock& clock)
+RelayDaemon::RelayDaemon(const std::string& confPath, EventLoop& loop, const Clock& clock,
+                         RandomSource random)
     : _loop(loop),
       _clock(clock),
       _conf(new RelaydConf(confPath.c_str())),
@@ -30,14 +31,14 @@ RelayDaemon::RelayDaemon(const std::string& confPath, EventLoop& loop, const Clo
                                              [this](const Json::Value& answer) { OnRegistered(answer); },
                                              [this] {
                                                  _alias.Stop();
-                                                 _tunnel.Stop(true);
-                                             }}),
-      _alias(*_conf, loop, clock,
-             AliasCycle::Hooks{[this] { return IsRegistered(); }, [this] { WriteStatus(); }}),
+                                                 _tunnel.Stop(false);
+                                             }},
+                    random),
+      _alias(*_conf, loop, clock, AliasCycle::Hooks{[this] { return IsRegistered(); }, nullptr}, random),
       _tunnel(loop, clock,
               TunnelCycle::Hooks{[this](RELAYD_STATE s, RELAYD_RET e) { SetState(s, e); },
                                  [this] { _registration.Start(IsRegistered()); }},
-              [] { return random(); }) {}
+              random) {}
 
 bool RelayDaemon::IsRegistered() const {
     return _state == RELAYD_STATE_DIRECT_CONNECT || _state == RELAYD_STATE_CONNECTED ||
@@ -51,6 +52,26 @@ void RelayDaemon::OnRegistered(const Json::Value& answer) {
 }
 
 int ReopenLogSignal() { return SIGRTMIN + 2; }
+
+// What the registration depends on: the relay switch, the servers, the
+// identity and the services. The log settings and the alias are not part of it.
+Json::Value RegistrationInputs(RelaydConf& conf) {
+    Json::Value inputs(Json::objectValue);
+    conf.Write(inputs["config"], false);
+    inputs["config"].removeMember("log_level");
+    inputs["config"].removeMember("log_file");
+    inputs["config"].removeMember("server_alias");
+    inputs["enable"] = conf.enable;
+    conf.auth.Write(inputs["identity"], true);
+    conf.WriteServices(inputs["services"], true);
+    return inputs;
+}
+
+Json::Value AliasInputs(RelaydConf& conf) {
+    Json::Value inputs(Json::objectValue);
+    conf.alias.Write(inputs, true);
+    return inputs;
+}
 
 void ApplyLogSettings(const RelaydConf& conf) {
     const std::string file = Daemon::ResolvePath(conf.logFile);
@@ -97,16 +118,36 @@ void RelayDaemon::HandleSignal(int sig) {
             Reload();
             break;
         case SIGCHLD:
-            ReapChildren();
+            // The tunnel reaps its own children first: it needs their end.
             _tunnel.OnChildExited();
+            ReapChildren();
+            break;
+        case SIGUSR2:
+            _tunnel.OnUpSignal();
             break;
         default:
             // SIGUSR1 comes this way only before the dump handler took it over
             // (debug_dump.h); that query then sees no answer and may ask again.
-            // SIGPIPE, SIGALRM, SIGUSR2, SIGRTMIN+5: their handlers only have to
-            // exist (the tunnel's wait relies on them); nothing to do here.
+            // SIGPIPE, SIGALRM, SIGRTMIN+5: their handlers only have to exist;
+            // nothing to do here.
             RLOG(LOG_DEBUG, "signal %d ignored", sig);
             break;
+    }
+}
+
+// Published once per round of events, when every cycle has done its part:
+// the dump first, so that what the status file says is in the dump already.
+void RelayDaemon::Idle() {
+    RenderDebugDump();
+    WriteStatus();
+    // A dump nobody collects would stay in /tmp for good.
+    if (TakeDumpWritten()) _loop.SetTimer("debug_dump_cleanup", 2000, [this] { RemoveGivenUpDump(); });
+}
+
+void RelayDaemon::RemoveGivenUpDump() {
+    const std::string path = Daemon::GetDebugPath(static_cast<int>(getpid()));
+    if (zeparelayd::RemoveGivenUpDump(path, 1000) == 1) {
+        _loop.SetTimer("debug_dump_cleanup", 1000, [this] { RemoveGivenUpDump(); });
     }
 }
 
@@ -122,19 +163,46 @@ void RelayDaemon::Reload() {
         SetState(_state, RELAYD_ERR_CONFIG);
         return;
     }
+    const Json::Value registrationBefore = RegistrationInputs(*_conf);
+    const Json::Value aliasBefore = AliasInputs(*_conf);
     if (!_conf->Reload()) {
         // The old configuration stays in force; the library said why.
         _configError = Daemon::GetConfPath() + ": not a valid relay configuration";
         SetState(_state, RELAYD_ERR_CONFIG);
         return;
     }
+    // A good file ends the error of a refused one.
+    const bool wasRefused = !_configError.empty() && _error == RELAYD_ERR_CONFIG;
     _configError.clear();
     ApplyLogSettings();
-    if (!_conf->enable) _alias.DeleteOnDisable();
-    _alias.Reset();
-    // A new configuration may name other servers: the tunnel starts afresh.
-    _tunnel.Stop(true);
-    _registration.Restart();
+    const Json::Value registrationAfter = RegistrationInputs(*_conf);
+    const Json::Value aliasAfter = AliasInputs(*_conf);
+    const bool registrationChanged = registrationAfter != registrationBefore;
+    const bool aliasChanged = aliasAfter != aliasBefore;
+    if (!_conf->enable) {
+        _alias.DeleteOnDisable();
+        _alias.Reset();
+        _tunnel.Stop(false);
+        _registration.Restart();
+        return;
+    }
+    if (registrationChanged || !IsRegistered()) {
+        // The answer decides about the tunnel: the same tunnel answer keeps
+        // it (TunnelCycle::OnRegistered).
+        RLOG(LOG_INFO, "reload: %s: registering again",
+             registrationChanged ? "servers, identity or services changed" : "not registered");
+        if (aliasChanged || _alias.Halted()) _alias.Reset();
+        _registration.Restart();
+        return;
+    }
+    if (wasRefused) SetState(_state, RELAYD_SUCCESS);
+    if (aliasChanged || _alias.Halted()) {
+        RLOG(LOG_INFO, "reload: alias settings changed: mapping it again");
+        _alias.Reset();
+        _alias.OnRegistered();
+        return;
+    }
+    RLOG(LOG_INFO, "reload: nothing changed for the relay: registration, alias and tunnel kept");
 }
 
 void RelayDaemon::ReapChildren() {
@@ -151,6 +219,7 @@ void RelayDaemon::Shutdown() {
     _alias.Stop();
     _tunnel.Stop(true);
     RemoveDebugDump();
+    zeparelayd::RemoveGivenUpDump(Daemon::GetDebugPath(static_cast<int>(getpid())), 0);
     SetState(RELAYD_STATE_STOPED, _error);
     RLOG(LOG_NOTICE, "stopped");
 }

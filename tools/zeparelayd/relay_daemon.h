@@ -34,6 +34,11 @@ int ReopenLogSignal();
 // the file is an appliance path, taken below the system root.
 void ApplyLogSettings(const ZEPA::Relay::RelaydConf& conf);
 
+// What a reload compares to decide what must start afresh: the registration's
+// inputs (relay switch, servers, identity, services) and the alias settings.
+Json::Value RegistrationInputs(ZEPA::Relay::RelaydConf& conf);
+Json::Value AliasInputs(ZEPA::Relay::RelaydConf& conf);
+
 // State words as the status readers show them:
 //   2 "starting"   configuration loaded, nothing sent yet
 //   3 "login"      registering with the control server, or waiting to retry
@@ -49,7 +54,9 @@ void ApplyLogSettings(const ZEPA::Relay::RelaydConf& conf);
 //   8 "stoped"     the daemon has stopped (written last, on the way out)
 class RelayDaemon {
 public:
-    RelayDaemon(const std::string& confPath, EventLoop& loop, const Clock& clock);
+    // random: the jitter of every cycle's retries.
+    RelayDaemon(const std::string& confPath, EventLoop& loop, const Clock& clock,
+                RandomSource random = SystemRandom());
 
     // Log settings of the configuration; called at start and on every reload.
     void ApplyLogSettings();
@@ -58,13 +65,15 @@ public:
     bool Start();
     // What each signal asks of the daemon; stop signals end the loop.
     void HandleSignal(int sig);
-    // After every round of events: refresh what SIGUSR1 will write.
-    void Idle() { RenderDebugDump(); }
+    // After every round of events: the status file (written when it changed)
+    // and what SIGUSR1 will write.
+    void Idle();
     // Final status ("stoped"); the caller removes the PID file.
     void Shutdown();
 
 private:
     void Reload();
+    void RemoveGivenUpDump();
     void ReapChildren();
     // States 4, 5 and 6: registered, however the appliance is reached.
     bool IsRegistered() const;

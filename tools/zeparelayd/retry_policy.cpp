@@ -1,5 +1,7 @@
 #include "retry_policy.h"
 
+#include <stdlib.h>
+
 #include <algorithm>
 
 using namespace ZEPA::Relay;
@@ -48,6 +50,10 @@ int64_t Deadline::RemainingMs() const {
 }
 
 // ---- registration ------------------------------------------------------------
+
+RandomSource SystemRandom() {
+    return [] { return random(); };
+}
 
 RegistrationPolicy::RegistrationPolicy(const Clock& clock, RandomSource random, RegistrationRules rules)
     : _clock(clock),

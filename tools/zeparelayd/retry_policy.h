@@ -18,6 +18,8 @@ namespace zeparelayd {
 
 // Source of jitter: random() in the daemon, chosen values in tests.
 using RandomSource = std::function<long()>;
+// The daemon's source: random().
+RandomSource SystemRandom();
 
 // How a wait after repeated failures is spread, d being the doubled wait:
 //   ADDED: d plus up to addedPercent of d;   FULL: anywhere in [0, d];

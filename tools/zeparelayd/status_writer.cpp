@@ -29,7 +29,8 @@ void RelayDaemon::SetState(RELAYD_STATE state, RELAYD_RET error) {
     }
     _state = state;
     _error = error;
-    WriteStatus();
+    // Written after the round (Idle), or at once when the loop has ended.
+    if (!_loop.Running()) WriteStatus();
 }
 
 namespace {
@@ -113,9 +114,9 @@ Json::Value RelayDaemon::DebugDump() const {
     return MaskSecrets(dump);
 }
 
+// The status file follows in Idle, after every round too, so a retry planned
+// after the last write shows up there as well.
 void RelayDaemon::RenderDebugDump() {
-    // A retry planned after the last write shows up in the status file too.
-    WriteStatus();
     Json::StreamWriterBuilder writer;
     writer["indentation"] = "   ";
     PublishDebugDump(Json::writeString(writer, DebugDump()) + "\n");

@@ -2,23 +2,37 @@
 // says it:
 //   "connect": "direct"  -> state 4 "direct_connect", no tunnel;
 //   "connect": "tunnel"  -> "tunnel": {"relay_ip", "relay_user", "relay_pass"}
-//                           is the Tunnel section: Tunnel::Create(true) (UDP,
-//                           then TCP); state 5 while it starts, 6 while it is up;
+//                           is the Tunnel section: openvpn over UDP, then TCP;
+//                           state 5 while it starts, 6 while it carries traffic;
 //   no "connect"         -> state 5 "connected", registered only.
-// A tunnel that fails to start or closes later (SIGCHLD, then
-// CheckStatusChanged) is torn down, the state is 3 with "err_network", and
-// the daemon registers again after TunnelPolicy's back-off with jitter, which
-// also fetches fresh credentials. "heartbeat": N in the answer registers again
-// after N seconds while registered.
+//
+// The start is driven from the event loop, step by step, instead of waiting
+// inside Tunnel::Create: the pass file and the child are the library's
+// (WritePassFile, TunnelExec), the wait for the up script is a loop timer,
+// and the up script's SIGUSR2 and the child's SIGCHLD arrive as ordinary
+// events (OnUpSignal, OnChildExited). So the daemon answers every signal and
+// drives every request while a start runs.
+//
+// The tunnel counts as up only once the up script has published a peer
+// address; a child still running without one after the wait is ended and the
+// attempt counts as failed. A tunnel whose peer address disappears (openvpn
+// restarting its connection after a link loss) is shown as state 5 until the
+// up script reports again. A tunnel that fails to start or closes later is
+// torn down, the state is 3 with "err_network", and the daemon registers again
+// after TunnelPolicy's back-off with jitter, which also fetches fresh
+// credentials. "heartbeat": N in the answer registers again after N seconds.
 #ifndef ZEPARELAYD_TOOL_TUNNEL_CYCLE_H
 #define ZEPARELAYD_TOOL_TUNNEL_CYCLE_H
 
 #include <json/value.h>
+#include <sys/types.h>
 
 #include <cstdint>
 #include <functional>
 #include <memory>
+#include <set>
 #include <string>
+#include <vector>
 
 #include <zeparelayd/errors.h>
 #include <zeparelayd/tunnel.h>
@@ -31,6 +45,13 @@ namespace zeparelayd {
 
 class TunnelCycle {
 public:
+    // How long a started openvpn has to report a peer address.
+    static constexpr int64_t UP_WAIT_MS = 40000;
+    // How long a child told to end has before it is killed.
+    static constexpr int64_t END_GRACE_MS = 3000;
+    // How often a tunnel that is up is checked for its peer address.
+    static constexpr int64_t LINK_CHECK_MS = 1000;
+
     struct Hooks {
         std::function<void(ZEPA::Relay::RELAYD_STATE, ZEPA::Relay::RELAYD_RET)> setState;
         // Register with the control server again (heartbeat, or reconnection
@@ -40,16 +61,30 @@ public:
 
     TunnelCycle(EventLoop& loop, const Clock& clock, Hooks hooks, RandomSource random);
 
+    // Tests shorten the wait for the up script.
+    void SetUpWaitMs(int64_t ms) { _upWaitMs = ms; }
+
     // The registration's successful answer (read through server_answer.h).
     void OnRegistered(const Json::Value& answer);
-    // After SIGCHLD, once the children are reaped: READY -> CLOSE.
+    // SIGUSR2: the up script has run (a start, or openvpn reconnecting).
+    void OnUpSignal();
+    // SIGCHLD: reaps the cycle's own children; a start whose child died
+    // fails, a tunnel that was up turns CLOSE.
     void OnChildExited();
-    // Stop, switch-off and reload: Destroy; with waitForChild the VPN child is
-    // also waited for (at most 3 s), so that none outlives the daemon.
+    // Stop, switch-off and reload: the child is told to end, the pass file and
+    // the tunnel info file go. With waitForChild the child is also waited for
+    // (at most 3 s, then killed), so that none outlives the daemon; without,
+    // its end arrives later through OnChildExited.
     void Stop(bool waitForChild);
 
     // Whether a tunnel is asked for and not up yet or up (states 5 and 6).
     bool HasTunnel() const { return static_cast<bool>(_tunnel); }
+    // Whether a start is under way.
+    bool Starting() const { return _starting; }
+    // Whether the tunnel carries traffic (READY with a peer address).
+    bool IsUp() const;
+    // Children told to end that have not been reaped yet.
+    size_t Ending() const { return _ending.size(); }
     // "connect" and, once a tunnel was asked for, "tunnel" (Tunnel::Write in
     // its full form, "peer_ip", "failures"); never the password.
     Json::Value Status() const;
@@ -57,9 +92,17 @@ public:
 
 private:
     void Open();
+    void StartNext();
+    void WaitExpired();
+    void ProtocolFailed();
+    void Up(const std::string& peer);
+    void CheckLink();
     void Failed(ZEPA::Relay::RELAYD_RET error);
     void ScheduleHeartbeat();
     void Teardown(bool waitForChild);
+    void EndChild(pid_t pid);
+    void RemovePassFile();
+    bool Reap(pid_t pid);
 
     EventLoop& _loop;
     const Clock& _clock;
@@ -69,6 +112,16 @@ private:
     std::unique_ptr<ZEPA::Relay::Tunnel> _tunnel;
     std::string _peer;
     int _heartbeatSeconds;
+    int64_t _upWaitMs;
+    // The start under way: protocols still to try, the pass file it wrote.
+    bool _starting;
+    bool _startDeferred;  // the next protocol waits for an ended child to go
+    std::vector<std::string> _protocols;
+    std::string _protocol;
+    std::string _passFile;
+    int64_t _startedMs;
+    bool _linkDown;
+    std::set<pid_t> _ending;
 };
 
 }  // namespace zeparelayd
