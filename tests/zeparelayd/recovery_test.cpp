@@ -1,6 +1,7 @@
 // What an earlier instance left behind, found and removed at start: only the
 // openvpn of this system root's tunnel, pass files, the tunnel info file and
 // the debug dumps of instances that no longer run.
+#include <fcntl.h>
 #include <gtest/gtest.h>
 #include <signal.h>
 #include <stdlib.h>
@@ -148,6 +149,38 @@ TEST_F(RecoveryTest, PlantedLinkAtAPassFileNameIsLeftAlone) {
     EXPECT_TRUE(left.files.empty());
     EXPECT_TRUE(Exists("/tmp/.tunnel.zr2"));
     EXPECT_TRUE(Exists("/tmp/target"));
+}
+
+// The wall clock set forward after the daemon wrote its files: they would read
+// as written before their process started, i.e. stale, until stamped anew.
+TEST_F(RecoveryTest, FilesStampedAnewReadAsTheRunningProcessAgain) {
+    const std::string pidFile = root + "/var/run/zeparelayd.pid";
+    ASSERT_TRUE(Daemon::SetPidFile(pidFile.c_str()));
+    Write("/var/run/zeparelayd.pid", std::to_string(getpid()) + "\n");
+    const std::string status = Daemon::GetStatusPath();
+    ASSERT_EQ(0u, status.find(root + "/"));
+    std::ofstream(status) << "{\"pid\": " << getpid() << "}";
+    const time_t hourAgo = time(nullptr) - 3600;
+    const struct timespec stamps[2] = {{hourAgo, 0}, {hourAgo, 0}};
+    for (const std::string& path : {pidFile, status})
+        ASSERT_EQ(0, utimensat(AT_FDCWD, path.c_str(), stamps, 0));
+    ASSERT_EQ(1, Daemon::ProbeFilePid(pidFile, getpid()));
+    ASSERT_EQ(1, Daemon::ProbeFilePid(status, getpid()));
+
+    zeparelayd::RefreshLivenessStamps();
+
+    EXPECT_EQ(0, Daemon::ProbeFilePid(pidFile, getpid()));
+    EXPECT_EQ(0, Daemon::ProbeFilePid(status, getpid()));
+
+    // A link planted at one of the names is not followed.
+    Write("/tmp/target", "keep");
+    ASSERT_EQ(0, utimensat(AT_FDCWD, (root + "/tmp/target").c_str(), stamps, 0));
+    ASSERT_EQ(0, unlink(status.c_str()));
+    ASSERT_EQ(0, symlink((root + "/tmp/target").c_str(), status.c_str()));
+    zeparelayd::RefreshLivenessStamps();
+    struct stat st;
+    ASSERT_EQ(0, stat((root + "/tmp/target").c_str(), &st));
+    EXPECT_EQ(hourAgo, st.st_mtime);
 }
 
 TEST_F(RecoveryTest, NothingLeftIsNothingDone) {

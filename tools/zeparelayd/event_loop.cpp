@@ -4,6 +4,8 @@
 
 #include <libdaemon/dsignal.h>
 #include <poll.h>
+#include <sys/timerfd.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <cerrno>
@@ -17,7 +19,12 @@ using ZEPA::Relay::Request;
 namespace zeparelayd {
 
 EventLoop::EventLoop(const Clock& clock)
-    : _clock(clock), _multi(curl_multi_init()), _curlDueMs(-1), _running(false) {
+    : _clock(clock),
+      _multi(curl_multi_init()),
+      _curlDueMs(-1),
+      _clockFd(timerfd_create(CLOCK_REALTIME, TFD_NONBLOCK | TFD_CLOEXEC)),
+      _running(false) {
+    WatchClock();
     if (_multi == nullptr) return;
     curl_multi_setopt(_multi, CURLMOPT_SOCKETFUNCTION, &EventLoop::SocketCallback);
     curl_multi_setopt(_multi, CURLMOPT_SOCKETDATA, this);
@@ -29,6 +36,27 @@ EventLoop::~EventLoop() {
     for (Job& job : _jobs) job.request->JobRemove(_multi);
     _jobs.clear();
     if (_multi != nullptr) curl_multi_cleanup(_multi);
+    if (_clockFd >= 0) close(_clockFd);
+}
+
+// A timer far in the future that the kernel cancels when the wall clock is
+// set: the only notice of a clock step.
+void EventLoop::WatchClock() {
+    if (_clockFd < 0) return;
+    struct itimerspec far = {};
+    far.it_value.tv_sec = INT_MAX;
+    if (timerfd_settime(_clockFd, TFD_TIMER_ABSTIME | TFD_TIMER_CANCEL_ON_SET, &far, nullptr) != 0) {
+        close(_clockFd);
+        _clockFd = -1;
+    }
+}
+
+void EventLoop::DrainClock() {
+    uint64_t expirations;
+    if (read(_clockFd, &expirations, sizeof(expirations)) >= 0 || errno != ECANCELED) return;
+    WatchClock();
+    RLOG(LOG_INFO, "the wall clock was set");
+    if (_onClockSet) _onClockSet();
 }
 
 int EventLoop::SocketCallback(CURL*, curl_socket_t fd, int what, void* userp, void*) {
@@ -106,13 +134,16 @@ bool EventLoop::Run() {
             if (s.second & CURL_POLL_OUT) events |= POLLOUT;
             fds.push_back(pollfd{s.first, events, 0});
         }
+        const size_t sockets = fds.size();
+        if (_clockFd >= 0) fds.push_back(pollfd{_clockFd, POLLIN, 0});
         int n = poll(fds.data(), fds.size(), PollTimeout());
         if (n < 0 && errno != EINTR) {
             RLOG(LOG_ERR, "poll failed (%d)", errno);
             return false;
         }
         if (n > 0 && (fds[0].revents & POLLIN)) DrainSignals();
-        for (size_t i = 1; n > 0 && _running && i < fds.size(); ++i) {
+        if (n > 0 && sockets < fds.size() && fds[sockets].revents != 0) DrainClock();
+        for (size_t i = 1; n > 0 && _running && i < sockets; ++i) {
             if (fds[i].revents == 0) continue;
             int mask = 0;
             if (fds[i].revents & POLLIN) mask |= CURL_CSELECT_IN;

@@ -35,6 +35,9 @@ public:
     void OnSignal(SignalHandler handler) { _onSignal = std::move(handler); }
     // Runs after every round of events, before the loop waits again.
     void OnIdle(TimerHandler handler) { _onIdle = std::move(handler); }
+    // Runs when the wall clock was set (a jump, e.g. the first time sync of
+    // a box without a clock battery).
+    void OnClockSet(TimerHandler handler) { _onClockSet = std::move(handler); }
 
     // One-shot timers by name; setting a name again replaces its deadline.
     void SetTimer(const std::string& name, int64_t delayMs, TimerHandler handler);
@@ -74,6 +77,8 @@ private:
 
     int PollTimeout() const;
     void DrainSignals();
+    void WatchClock();
+    void DrainClock();
     void SocketAction(curl_socket_t fd, int mask);
     void CollectFinished();
     void RunDueTimers();
@@ -84,8 +89,10 @@ private:
     int64_t _curlDueMs;                     // -1: curl wants no timeout
     std::map<std::string, Timer> _timers;
     std::list<Job> _jobs;
+    int _clockFd;  // -1 when the clock cannot be watched
     SignalHandler _onSignal;
     TimerHandler _onIdle;
+    TimerHandler _onClockSet;
     bool _running;
 };
 

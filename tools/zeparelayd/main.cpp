@@ -221,6 +221,7 @@ int RunLoop(const std::string& confPath, const sigset_t& previous) {
     }
     loop.OnSignal([&relay](int sig) { relay.HandleSignal(sig); });
     loop.OnIdle([&relay] { relay.Idle(); });
+    loop.OnClockSet([] { zeparelayd::RefreshLivenessStamps(); });
     // Before any tunnel: never two openvpn for one appliance.
     zeparelayd::RemoveLeftovers();
     const bool started = relay.Start();
