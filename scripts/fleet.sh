@@ -7,6 +7,7 @@
 #   --out DIR       CSV series and PNG plots (default build/fleet/out)
 #   --scenario S    only this scenario (repeatable; fleet_sim --list names them)
 #   --variants      the trade-off table of rule variants instead (default N 20000)
+#   --rules R       these rules (fleet_sim --list names them); with --variants, only these rows (repeatable)
 #   --check         exit 1 when a goal is not met
 set -euo pipefail
 cd "$(dirname "$0")/.."
@@ -21,9 +22,10 @@ while [ $# -gt 0 ]; do
     -n|--appliances) [ $# -ge 2 ] || { echo "fleet.sh: $1 needs a number" >&2; exit 64; }; n=$2; shift ;;
     --out) [ $# -ge 2 ] || { echo "fleet.sh: --out needs a folder" >&2; exit 64; }; out=$2; shift ;;
     --scenario) [ $# -ge 2 ] || { echo "fleet.sh: --scenario needs a name" >&2; exit 64; }; args+=(--scenario "$2"); shift ;;
+    --rules) [ $# -ge 2 ] || { echo "fleet.sh: --rules needs a name" >&2; exit 64; }; args+=(--rules "$2"); shift ;;
     --variants) variants=1 ;;
     --check) args+=(--check) ;;
-    -h|--help) sed -n '2,10p' "$0" | sed 's/^# \{0,1\}//'; exit 0 ;;
+    -h|--help) sed -n '2,11p' "$0" | sed 's/^# \{0,1\}//'; exit 0 ;;
     *) echo "fleet.sh: unknown option '$1' (try --help)" >&2; exit 64 ;;
   esac
   shift

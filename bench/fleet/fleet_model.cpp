@@ -320,7 +320,7 @@ private:
                 // SIGCHLD, then CheckStatusChanged: READY -> CLOSE.
                 if (a.tunnelUp) {
                     a.tunnelUp = false;
-                    TunnelFailed(i, a);
+                    TunnelFailed(i, a, true);
                 }
                 break;
             default:
@@ -448,9 +448,9 @@ private:
     }
 
     // TunnelCycle::Failed.
-    void TunnelFailed(uint32_t i, Appliance& a) {
+    void TunnelFailed(uint32_t i, Appliance& a, bool wasUp = false) {
         TunnelTeardown(a);
-        const int64_t delay = a.tunnel.OnFailure();
+        const int64_t delay = wasUp ? a.tunnel.OnClosed() : a.tunnel.OnFailure();
         Cancel(a, S_HEARTBEAT);
         SetState(a, RELAYD_STATE_LOGIN);
         After(i, S_TUNNEL_RETRY, delay);
@@ -637,7 +637,20 @@ bool FindScenario(const std::string& name, Scenario& out) {
             return true;
         }
     }
-    return false;
+    // Any other outage: "outage-<number><s|m|h>-<refused|hanging>", up to a day.
+    long long length = 0;
+    char unit = 0;
+    char how[16] = {};
+    int used = 0;
+    if (sscanf(name.c_str(), "outage-%9lld%c-%15[a-z]%n", &length, &unit, how, &used) != 3 ||
+        used != static_cast<int>(name.size()) || length <= 0) {
+        return false;
+    }
+    const int64_t scale = unit == 's' ? SECOND : unit == 'm' ? MINUTE : unit == 'h' ? HOUR : 0;
+    const std::string kind = how;
+    if (scale == 0 || (kind != "refused" && kind != "hanging") || length * scale > 24 * HOUR) return false;
+    out = {name, ScenarioKind::OUTAGE, length * scale, kind == "hanging"};
+    return true;
 }
 
 std::vector<Rules> RuleVariants() {
@@ -652,6 +665,8 @@ std::vector<Rules> RuleVariants() {
     before.registration.fromAttemptStart = false;
     before.registration.startSpreadMs = 0;
     before.tunnel.failure = {2 * SECOND, 5 * MINUTE, JitterKind::ADDED, 25};
+    before.tunnel.closedMs = 2 * SECOND;  // a closed tunnel alike: its first failure
+    before.tunnel.closedSpreadMs = 500;
     out.push_back(before);
     auto backoff = [&](const char* name, BackoffRule rule, bool fromAttemptStart = false) {
         Rules r = before;
@@ -677,25 +692,51 @@ std::vector<Rules> RuleVariants() {
         change(r);
         out.push_back(r);
     };
+    // Every tunnel retry spread, a closed tunnel's and a failed start's alike.
     plus("+tunnel-full-2m", [](Rules& r) {
         r.tunnel.failure = {2 * MINUTE, 5 * MINUTE, JitterKind::FULL, 0};
+        r.tunnel.closedMs = 0;
+        r.tunnel.closedSpreadMs = 2 * MINUTE;
     });
     plus("+tunnel-equal-2m", [](Rules& r) {
         r.tunnel.failure = {2 * MINUTE, 5 * MINUTE, JitterKind::EQUAL, 0};
+        r.tunnel.closedMs = MINUTE;
+        r.tunnel.closedSpreadMs = MINUTE;
     });
     plus("+dns-jitter-20s", [](Rules& r) { r.registration.resolveJitterMs = 20 * SECOND; });
     plus("+dns-backs-off", [](Rules& r) { r.registration.resolveBacksOff = true; });
     plus("+start-spread-2m", [](Rules& r) { r.registration.startSpreadMs = 2 * MINUTE; });
     plus("+start-spread-3m", [](Rules& r) { r.registration.startSpreadMs = 3 * MINUTE; });
     plus("+move-spread-2m", [](Rules& r) { r.registration.moveSpreadMs = 2 * MINUTE; });
-    // The daemon's defaults: the cadence, lookups backing off, a 3-minute
-    // start-up spread; the tunnel as before.
+    // The daemon's defaults.
     out.push_back(Rules());
-    // And with the tunnel's first retry spread over two minutes as well.
-    Rules spread;
-    spread.name = "shipped+tunnel-2m";
-    spread.tunnel.failure = {2 * MINUTE, 5 * MINUTE, JitterKind::FULL, 0};
-    out.push_back(spread);
+    // The defaults with other tunnel rules: the first retry of a tunnel that
+    // was up and closed after closedMs plus up to spreadMs; a failed start
+    // after failure.
+    auto tunnel = [&](const char* name, int64_t closedMs, int64_t spreadMs,
+                      BackoffRule failure = Rules().tunnel.failure) {
+        Rules r;
+        r.name = name;
+        r.tunnel.failure = failure;
+        r.tunnel.closedMs = closedMs;
+        r.tunnel.closedSpreadMs = spreadMs;
+        out.push_back(r);
+    };
+    // As before the tunnel rule was measured: 2 s plus up to a quarter.
+    tunnel("tunnel-2s", 2 * SECOND, 500);
+    tunnel("tunnel-all-full-2m", 0, 2 * MINUTE, {2 * MINUTE, 5 * MINUTE, JitterKind::FULL, 0});
+    tunnel("tunnel-closed-0-5m", 0, 5 * MINUTE);
+    tunnel("tunnel-closed-0-4m", 0, 4 * MINUTE);
+    tunnel("tunnel-closed-0-3m", 0, 3 * MINUTE);
+    tunnel("tunnel-closed-0-2m", 0, 2 * MINUTE);
+    tunnel("tunnel-closed-2s+2m", 2 * SECOND, 2 * MINUTE);
+    tunnel("tunnel-closed-0-90s", 0, 90 * SECOND);
+    tunnel("tunnel-closed-2s+90s", 2 * SECOND, 90 * SECOND);
+    tunnel("tunnel-closed-0-75s", 0, 75 * SECOND);
+    tunnel("tunnel-closed-0-60s", 0, 60 * SECOND);
+    tunnel("tunnel-closed-2s+60s", 2 * SECOND, 60 * SECOND);
+    tunnel("tunnel-closed-0-45s", 0, 45 * SECOND);
+    tunnel("tunnel-closed-0-30s", 0, 30 * SECOND);
     return out;
 }
 

@@ -39,7 +39,7 @@ struct Rules {
     zeparelayd::TunnelRules tunnel;
 };
 
-// The variants of the trade-off table (the first is the shipped rules).
+// The variants of the trade-off table ("shipped": the daemon's defaults).
 std::vector<Rules> RuleVariants();
 bool FindRules(const std::string& name, Rules& out);
 

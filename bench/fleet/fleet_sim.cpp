@@ -19,8 +19,10 @@ void Usage(FILE* out) {
         out,
         "usage: fleet_sim [options]\n"
         "  -n, --appliances N     fleet size (default 100000)\n"
-        "  --scenario NAME        run only this scenario (repeatable); --list names them\n"
-        "  --rules NAME           retry rules (default: shipped); --list names the variants\n"
+        "  --scenario NAME        run only this scenario (repeatable); --list names them;\n"
+        "                         also any outage-<n><s|m|h>-<refused|hanging> up to 24 h\n"
+        "  --rules NAME           retry rules (default: shipped); --list names the variants;\n"
+        "                         with --variants: only these rows (repeatable)\n"
         "  --variants             trade-off table: every rule variant over the outage and power scenarios\n"
         "  --seed S               jitter and fleet seed (default 1)\n"
         "  --heartbeat S          heartbeat the control server asks for, seconds (default 300)\n"
@@ -70,7 +72,7 @@ double WorstTime(double a, double b) {
 int main(int argc, char** argv) {
     fleet::FleetConfig config;
     std::vector<std::string> names;
-    std::string rulesName = "shipped";
+    std::vector<std::string> rulesNames;
     std::string csvDir;
     bool check = false, variants = false;
     for (int i = 1; i < argc; ++i) {
@@ -88,7 +90,7 @@ int main(int argc, char** argv) {
         } else if (arg == "--scenario") {
             names.push_back(Value(argc, argv, i));
         } else if (arg == "--rules") {
-            rulesName = Value(argc, argv, i);
+            rulesNames.push_back(Value(argc, argv, i));
         } else if (arg == "--variants") {
             variants = true;
         } else if (arg == "--seed") {
@@ -151,15 +153,22 @@ int main(int argc, char** argv) {
         scenarios.push_back(s);
     }
     std::vector<fleet::Rules> ruleSets;
-    if (variants) {
+    if (variants && rulesNames.empty()) {
         ruleSets = fleet::RuleVariants();
     } else {
-        fleet::Rules r;
-        if (!fleet::FindRules(rulesName, r)) {
-            fprintf(stderr, "fleet_sim: no rules '%s' (--list names them)\n", rulesName.c_str());
+        if (rulesNames.empty()) rulesNames.push_back("shipped");
+        if (!variants && rulesNames.size() > 1) {
+            fprintf(stderr, "fleet_sim: more than one --rules needs --variants\n");
             return 64;
         }
-        ruleSets.push_back(r);
+        for (const std::string& name : rulesNames) {
+            fleet::Rules r;
+            if (!fleet::FindRules(name, r)) {
+                fprintf(stderr, "fleet_sim: no rules '%s' (--list names them)\n", name.c_str());
+                return 64;
+            }
+            ruleSets.push_back(r);
+        }
     }
     if (!csvDir.empty() && mkdir(csvDir.c_str(), 0755) != 0 && errno != EEXIST) {
         fprintf(stderr, "fleet_sim: cannot create %s: %s\n", csvDir.c_str(), strerror(errno));
@@ -238,13 +247,13 @@ int main(int argc, char** argv) {
                config.appliances);
         printf(
             "(peaks: control server, highest 60-s mean / steady; lock-step: scenarios with a kind in it)\n");
-        printf("%-18s %11s %10s %10s %9s %8s %9s %9s %6s\n", "rules", "outage peak", "outage 99%",
+        printf("%-22s %11s %10s %10s %9s %8s %9s %9s %6s\n", "rules", "outage peak", "outage 99%",
                "power peak", "power 99%", "dns peak", "move peak", "lockstep", "missed");
         for (const VariantRow& row : rows) {
             char o99[16], p99[16];
             snprintf(o99, sizeof o99, row.outageRecover < 0 ? "never" : "%.0f s", row.outageRecover);
             snprintf(p99, sizeof p99, row.powerRecover < 0 ? "never" : "%.0f s", row.powerRecover);
-            printf("%-18s %10.2fx %10s %9.2fx %9s %7.2fx %8.2fx %9d %6d\n", row.rules.c_str(), row.outagePeak,
+            printf("%-22s %10.2fx %10s %9.2fx %9s %7.2fx %8.2fx %9d %6d\n", row.rules.c_str(), row.outagePeak,
                    o99, row.powerPeak, p99, row.dnsPeak, row.movePeak, row.lockStep, row.goalsMissed);
         }
     }

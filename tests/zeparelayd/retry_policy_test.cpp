@@ -15,6 +15,8 @@ using zeparelayd::BackoffRule;
 using zeparelayd::JitterKind;
 using zeparelayd::RegistrationPolicy;
 using zeparelayd::RegistrationRules;
+using zeparelayd::TunnelPolicy;
+using zeparelayd::TunnelRules;
 
 using zepatest::FakeClock;
 using zepatest::FixedRandom;
@@ -209,6 +211,39 @@ TEST(BackoffRuleTest, TheRulesBeforeTheFleetWasMeasuredStillRun) {
     }
     EXPECT_EQ(10000, policy.OnFailure(RELAYD_ERR_RESOLV));
     EXPECT_EQ(0, policy.OnStart());
+}
+
+// The tunnel's variants: a close waits closedMs plus up to closedSpreadMs,
+// a failed start follows its back-off whatever the close does.
+TEST(TunnelRulesTest, AClosedTunnelWaitsItsFloorPlusUpToItsSpread) {
+    FakeClock clock;
+    FixedRandom jitter;
+    TunnelRules rules;
+    rules.closedMs = 2000;
+    rules.closedSpreadMs = 60000;
+    TunnelPolicy policy(clock, jitter.Source(), rules);
+    jitter.value = 0;
+    EXPECT_EQ(2000, policy.OnClosed());
+    policy.OnUp();
+    jitter.value = 60000;
+    EXPECT_EQ(62000, policy.OnClosed());
+    policy.OnUp();
+    jitter.value = 60001;
+    EXPECT_EQ(2000, policy.OnClosed());
+
+    // No spread: exactly the floor; the rule before the fleet was measured
+    // (2 s plus up to a quarter) is the floor 2 s and a spread of 0.5 s.
+    rules.closedMs = 2000;
+    rules.closedSpreadMs = 0;
+    TunnelPolicy fixed(clock, jitter.Source(), rules);
+    jitter.value = 12345;
+    EXPECT_EQ(2000, fixed.OnClosed());
+    rules.closedSpreadMs = 500;
+    TunnelPolicy before(clock, jitter.Source(), rules);
+    jitter.value = 500;
+    EXPECT_EQ(2500, before.OnClosed());
+    before.OnUp();
+    EXPECT_EQ(2500, before.OnFailure());
 }
 
 class AliasPolicyTest : public ::testing::Test {

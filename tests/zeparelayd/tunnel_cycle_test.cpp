@@ -60,6 +60,49 @@ TEST_F(TunnelPolicyTest, JitterIsAtMostAQuarter) {
     EXPECT_GE(policy.BackoffMs(1), 2000);
 }
 
+TEST_F(TunnelPolicyTest, AClosedTunnelRegistersAgainWithinTwoMinutes) {
+    jitter = 0;
+    EXPECT_EQ(0, policy.OnClosed());
+    EXPECT_EQ(1, policy.Failures());
+    policy.OnUp();
+    jitter = 120000;
+    EXPECT_EQ(120000, policy.OnClosed());
+    policy.OnUp();
+    jitter = 120001;  // one past the spread wraps round to none
+    EXPECT_EQ(0, policy.OnClosed());
+    policy.OnUp();
+    jitter = 45678;
+    EXPECT_EQ(45678, policy.OnClosed());
+    EXPECT_EQ(45678, policy.RemainingMs());
+    clock.Advance(45000);
+    EXPECT_EQ(678, policy.RemainingMs());
+    // Whatever the source gives, the wait stays within the two minutes.
+    for (long r : {-1L, -120001L, 7L, 119999L, 240002L, 2147483647L, -2147483647L - 1}) {
+        policy.OnUp();
+        jitter = r;
+        const int64_t wait = policy.OnClosed();
+        EXPECT_GE(wait, 0) << r;
+        EXPECT_LE(wait, 120000) << r;
+    }
+}
+
+// A start that fails is the appliance's own affair: it keeps the quick
+// doubling, also when it follows a close.
+TEST_F(TunnelPolicyTest, AStartThatFailsAfterACloseGoesOnDoublingFromTheClose) {
+    jitter = 30000;
+    EXPECT_EQ(30000, policy.OnClosed());
+    jitter = 0;
+    EXPECT_EQ(4000, policy.OnFailure());
+    EXPECT_EQ(8000, policy.OnFailure());
+    EXPECT_EQ(3, policy.Failures());
+    // Up again: the next close is spread afresh, the next failed start 2 s.
+    policy.OnUp();
+    jitter = 90000;
+    EXPECT_EQ(90000, policy.OnClosed());
+    policy.OnUp();
+    EXPECT_EQ(2000 + 90000 % 501, policy.OnFailure());
+}
+
 TEST_F(TunnelPolicyTest, DeadlineFollowsTheClockAndUpStartsAfresh) {
     EXPECT_EQ(-1, policy.RemainingMs());
     policy.OnFailure();
@@ -86,7 +129,7 @@ protected:
                                        states.push_back({s, e});
                                    },
                                    [this] { ++reregistrations; }},
-                [] { return 0L; }) {}
+                [this] { return jitter; }) {}
 
     void SetUp() override {
         char dir[] = "/tmp/zepa_tunnel_cycle_XXXXXX";
@@ -109,6 +152,7 @@ protected:
         ASSERT_TRUE(loop.Run());
     }
 
+    long jitter = 0;  // what the cycle's jitter source gives
     zeparelayd::MonotonicClock monotonic;
     EventLoop loop{monotonic};
     std::vector<std::pair<RELAYD_STATE, RELAYD_RET>> states;
@@ -317,6 +361,48 @@ TEST_F(TunnelStartTest, PeerAddressFromTheUpScriptMakesItReadyAndThePassFileGoes
     cycle.Stop(true);
     EXPECT_NE(0, kill(pid, 0));
     EXPECT_FALSE(Exists("/tmp/.zepa_farlink_tunnel_info"));
+}
+
+// openvpn exits with the tunnel up (its relay went away): torn down, then
+// registered again after the close's spread wait, not the start's 2 s.
+TEST_F(TunnelStartTest, ATunnelThatWasUpAndClosedRegistersAgainAfterTheSpreadWait) {
+    Write("/etc/openvpn.mode", "up");
+    jitter = 700;
+    AskForTunnel();
+    ASSERT_TRUE(RunUntil([&] { return cycle.IsUp(); }, 5000));
+    const int pid = TunnelPid();
+    ASSERT_GT(pid, 0);
+    ASSERT_EQ(0, kill(pid, SIGTERM));
+    ASSERT_TRUE(RunUntil([&] { return SawState(RELAYD_STATE_LOGIN); }, 3000));
+    EXPECT_EQ(RELAYD_ERR_NETWORK, states.back().second);
+    EXPECT_EQ("CLOSE", cycle.Status()["tunnel"]["status"].asString());
+    EXPECT_EQ(1, cycle.Status()["tunnel"]["failures"].asInt());
+    EXPECT_FALSE(Exists("/tmp/.zepa_farlink_tunnel_info"));
+    const int64_t retry = loop.TimerRemaining("tunnel_retry");
+    EXPECT_GT(retry, 0);
+    EXPECT_LE(retry, 700);
+    EXPECT_EQ(-1, loop.TimerRemaining("heartbeat"));
+    EXPECT_EQ(0, reregistrations);
+    ASSERT_TRUE(RunUntil([&] { return reregistrations == 1; }, 3000));
+    EXPECT_EQ(-1, loop.TimerRemaining("tunnel_retry"));
+}
+
+TEST_F(TunnelStartTest, ASecondFailedStartWaitsTwiceAsLong) {
+    Write("/etc/openvpn.mode", "die");
+    jitter = 700;  // 2 s plus 700 % 501 ms; then 4 s plus 700 % 1001 ms
+    AskForTunnel();
+    ASSERT_TRUE(RunUntil([&] { return SawState(RELAYD_STATE_LOGIN); }, 5000));
+    EXPECT_EQ("FAILED", cycle.Status()["tunnel"]["status"].asString());
+    int64_t retry = loop.TimerRemaining("tunnel_retry");
+    EXPECT_GT(retry, 1000);  // not the close's 700 ms
+    EXPECT_LE(retry, 2199);
+    states.clear();
+    AskForTunnel();
+    ASSERT_TRUE(RunUntil([&] { return SawState(RELAYD_STATE_LOGIN); }, 5000));
+    EXPECT_EQ(2, cycle.Status()["tunnel"]["failures"].asInt());
+    retry = loop.TimerRemaining("tunnel_retry");
+    EXPECT_GT(retry, 2700);
+    EXPECT_LE(retry, 4700);
 }
 
 TEST_F(TunnelStartTest, SilentChildIsNeverReadyAndIsEndedAfterTheWait) {

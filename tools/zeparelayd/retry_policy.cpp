@@ -224,6 +224,13 @@ int64_t TunnelPolicy::OnFailure() {
     return _lastBackoffMs;
 }
 
+int64_t TunnelPolicy::OnClosed() {
+    ++_failures;
+    _lastBackoffMs = std::max<int64_t>(_rules.closedMs, 0) + Jitter(_random, _rules.closedSpreadMs);
+    _due.Arm(_lastBackoffMs);
+    return _lastBackoffMs;
+}
+
 void TunnelPolicy::OnUp() {
     _failures = 0;
     _lastBackoffMs = 0;

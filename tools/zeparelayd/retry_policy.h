@@ -56,8 +56,15 @@ struct RegistrationRules {
     int64_t startSpreadMs = 180000;  // first registration after start: up to this much
 };
 
+// The tunnel's rules. openvpn rides out short link losses by itself, so a
+// tunnel that was up only closes when its relay has been away for a while,
+// and a relay outage closes a whole fleet's tunnels within seconds: their
+// first retry is spread over closedSpreadMs. A start that failed (never up)
+// is an appliance's own affair and keeps the quick back-off.
 struct TunnelRules {
-    BackoffRule failure{2000, 300000, JitterKind::ADDED, 25};
+    BackoffRule failure{2000, 300000, JitterKind::ADDED, 25};  // a start that failed
+    int64_t closedMs = 0;                                      // a tunnel that was up closed: this ...
+    int64_t closedSpreadMs = 120000;                           // ... plus up to this much
 };
 
 // A wait that was decided, and when it runs out.
@@ -199,19 +206,23 @@ private:
     int _retryClass;
 };
 
-// Reconnecting a tunnel that failed to open or closed later: register again
-// (which also fetches fresh credentials) after 2 s doubling per consecutive
-// failure up to 5 min, plus up to a quarter of the wait as jitter. A tunnel
-// that comes up, or an answer without a tunnel, starts the count afresh.
-// (A relay outage closes every tunnel within the same few seconds, so these
-// re-registrations arrive close together; spreading the first one over two
-// minutes would smooth that, at the price of a slower single reconnection.)
+// Reconnecting a tunnel by registering again (which also fetches fresh
+// credentials):
+//   - a tunnel that was up and closed (openvpn exited): after a random 0 to
+//     2 minutes, so that the tunnels a relay outage closes together do not
+//     come back together; it counts as the first failure;
+//   - a start that failed: after 2 s doubling per consecutive failure up to
+//     5 min, plus up to a quarter of the wait as jitter.
+// A tunnel that comes up, or an answer without a tunnel, starts the count
+// afresh.
 class TunnelPolicy {
 public:
     TunnelPolicy(const Clock& clock, RandomSource random, TunnelRules rules = TunnelRules());
 
-    // The tunnel failed: the wait before registering again.
+    // A start failed: the wait before registering again.
     int64_t OnFailure();
+    // A tunnel that was up closed: the wait before registering again.
+    int64_t OnClosed();
     void OnUp();
     // Registering again now, or the cycle stops: nothing is due any more.
     void OnAttempt() { _due.Clear(); }

@@ -246,9 +246,9 @@ void TunnelCycle::CheckLink() {
     _loop.SetTimer(kLinkTimer, LINK_CHECK_MS, [this] { CheckLink(); });
 }
 
-void TunnelCycle::Failed(RELAYD_RET error) {
+void TunnelCycle::Failed(RELAYD_RET error, bool wasUp) {
     Teardown(false);
-    const int64_t delay = _policy.OnFailure();
+    const int64_t delay = wasUp ? _policy.OnClosed() : _policy.OnFailure();
     RLOG(LOG_INFO, "tunnel retry %d in %lld ms", _policy.Failures(), static_cast<long long>(delay));
     _loop.CancelTimer(kHeartbeatTimer);
     _hooks.setState(RELAYD_STATE_LOGIN, error);
@@ -285,7 +285,7 @@ void TunnelCycle::OnChildExited() {
             _tunnel->IsAlive();  // pid -1
             if (_tunnel->CheckStatusChanged()) {
                 RLOG(LOG_WARNING, "tunnel to [%s] closed", _tunnel->relay_ip.c_str());
-                Failed(RELAYD_ERR_NETWORK);
+                Failed(RELAYD_ERR_NETWORK, true);
             }
         }
     }

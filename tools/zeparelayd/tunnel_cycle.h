@@ -19,8 +19,9 @@
 // restarting its connection after a link loss) is shown as state 5 until the
 // up script reports again. A tunnel that fails to start or closes later is
 // torn down, the state is 3 with "err_network", and the daemon registers again
-// after TunnelPolicy's back-off with jitter, which also fetches fresh
-// credentials. "heartbeat": N in the answer registers again after N seconds.
+// after TunnelPolicy's wait (spread over minutes after a close, quick after a
+// failed start), which also fetches fresh credentials. "heartbeat": N in the answer registers again after N
+// seconds.
 #ifndef ZEPARELAYD_TOOL_TUNNEL_CYCLE_H
 #define ZEPARELAYD_TOOL_TUNNEL_CYCLE_H
 
@@ -97,7 +98,8 @@ private:
     void ProtocolFailed();
     void Up(const std::string& peer);
     void CheckLink();
-    void Failed(ZEPA::Relay::RELAYD_RET error);
+    // wasUp: the tunnel had come up and closed, rather than failed to start.
+    void Failed(ZEPA::Relay::RELAYD_RET error, bool wasUp = false);
     void ScheduleHeartbeat();
     void Teardown(bool waitForChild);
     void EndChild(pid_t pid);
