@@ -62,7 +62,8 @@ struct SeriesFigures {
     double peak = 0;    // highest mean of a 60-second window from the disturbance on
     double peakAfterReturn = 0;
     double busiestRatio = 0;  // busiest second / mean of its minute, over minutes averaging >= 20/s
-    bool lockStep = false;    // a second above 3x its minute's mean that chance does not explain
+    bool lockStep = false;    // a second above 3x its minute's mean that chance (at the busier
+                              // half-minute's rate) does not explain
 };
 
 struct Result {

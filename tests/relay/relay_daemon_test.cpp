@@ -128,7 +128,7 @@ TEST_F(RelayDaemonTest, TunnelComesUpIsShownAndCarriesThePageAndComesBackAfterAL
     EXPECT_NE(std::string::npos, page.find("you reached the management page")) << page;
 
     // The relay's VPN servers go away: the daemon notices (SIGCHLD), reports
-    // the loss and schedules its registration within two minutes (the tunnel
+    // the loss and schedules its registration within five minutes (the tunnel
     // was up: a relay outage closes a whole fleet's tunnels at once). The
     // timer's own firing is tested on the cycle (tests/zeparelayd); here a
     // reload, which registers at once while not registered, brings the new
@@ -142,7 +142,7 @@ TEST_F(RelayDaemonTest, TunnelComesUpIsShownAndCarriesThePageAndComesBackAfterAL
     const std::string log = Log();
     const long long retryMs = atoll(log.c_str() + log.find("tunnel retry 1 in ") + 18);
     EXPECT_GE(retryMs, 0) << log;
-    EXPECT_LE(retryMs, 120000) << log;
+    EXPECT_LE(retryMs, 300000) << log;
     ASSERT_TRUE(relay.Vpn("start"));
     std::string out;
     ASSERT_EQ(0, Ctl({"reload"}, &out)) << out;

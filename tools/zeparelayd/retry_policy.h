@@ -56,15 +56,19 @@ struct RegistrationRules {
     int64_t startSpreadMs = 180000;  // first registration after start: up to this much
 };
 
-// The tunnel's rules. openvpn rides out short link losses by itself, so a
-// tunnel that was up only closes when its relay has been away for a while,
-// and a relay outage closes a whole fleet's tunnels within seconds: their
-// first retry is spread over closedSpreadMs. A start that failed (never up)
-// is an appliance's own affair and keeps the quick back-off.
+// The tunnel's rules. openvpn rides out link losses shorter than its ping
+// time-out by itself, so a tunnel that was up closes when its relay has been
+// out of reach for a while, and a relay outage closes a whole fleet's tunnels
+// within seconds: their first retry is spread over closedSpreadMs. Spread over
+// the registration's 5-minute cadence, they take random places in it, as the
+// other appliances do; a shorter spread keeps them bunched for hours, and a
+// relay that returns near the end of the bunch gets their tunnels in a burst.
+// A start that failed (never up) is an appliance's own affair and keeps the
+// quick back-off.
 struct TunnelRules {
     BackoffRule failure{2000, 300000, JitterKind::ADDED, 25};  // a start that failed
     int64_t closedMs = 0;                                      // a tunnel that was up closed: this ...
-    int64_t closedSpreadMs = 120000;                           // ... plus up to this much
+    int64_t closedSpreadMs = 300000;                           // ... plus up to this much
 };
 
 // A wait that was decided, and when it runs out.
@@ -209,7 +213,7 @@ private:
 // Reconnecting a tunnel by registering again (which also fetches fresh
 // credentials):
 //   - a tunnel that was up and closed (openvpn exited): after a random 0 to
-//     2 minutes, so that the tunnels a relay outage closes together do not
+//     5 minutes, so that the tunnels a relay outage closes together do not
 //     come back together; it counts as the first failure;
 //   - a start that failed: after 2 s doubling per consecutive failure up to
 //     5 min, plus up to a quarter of the wait as jitter.

@@ -19,7 +19,7 @@
 // restarting its connection after a link loss) is shown as state 5 until the
 // up script reports again. A tunnel that fails to start or closes later is
 // torn down, the state is 3 with "err_network", and the daemon registers again
-// after TunnelPolicy's wait (spread over minutes after a close, quick after a
+// after TunnelPolicy's wait (0 to 5 minutes after a close, 2 s doubling after a
 // failed start), which also fetches fresh credentials. "heartbeat": N in the answer registers again after N
 // seconds.
 #ifndef ZEPARELAYD_TOOL_TUNNEL_CYCLE_H
