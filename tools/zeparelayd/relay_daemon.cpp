@@ -13,6 +13,7 @@
 #include "config_check.h"
 #include "debug_dump.h"
 #include "log.h"
+#include "relayd_protocol.h"
 #include "systemd_notify.h"
 
 using namespace ZEPA::Relay;
@@ -50,8 +51,6 @@ void RelayDaemon::OnRegistered(const Json::Value& answer) {
     // A heartbeat leaves a scheduled or running alias exchange alone.
     if (!_alias.Pending()) _alias.OnRegistered();
 }
-
-int ReopenLogSignal() { return SIGRTMIN + 2; }
 
 // What the registration depends on: the relay switch, the servers, the
 // identity and the services. The log settings and the alias are not part of it.
@@ -96,38 +95,35 @@ bool RelayDaemon::Start() {
 }
 
 void RelayDaemon::HandleSignal(int sig) {
-    if (sig == SIGRTMIN + 1) {
-        _alias.OnRequested();
-        return;
-    }
-    if (sig == ReopenLogSignal()) {
-        // Same file and level as now: SetLogFile reopens it (appending).
-        RLOG(LOG_INFO, "reopening the log file");
-        Daemon::SetLogFile(Daemon::_strLogFile, Daemon::_logLevel);
-        RLOG(LOG_INFO, "log file reopened");
-        return;
-    }
-    switch (sig) {
-        case SIGTERM:
-        case SIGINT:
-        case SIGQUIT:
+    switch (zepatools::MeaningOf(sig)) {
+        case zepatools::DaemonSignal::UPDATE_ALIAS:
+            _alias.OnRequested();
+            break;
+        case zepatools::DaemonSignal::REOPEN_LOG:
+            // Same file and level as now: SetLogFile reopens it (appending).
+            RLOG(LOG_INFO, "reopening the log file");
+            Daemon::SetLogFile(Daemon::_strLogFile, Daemon::_logLevel);
+            RLOG(LOG_INFO, "log file reopened");
+            break;
+        case zepatools::DaemonSignal::STOP:
             RLOG(LOG_NOTICE, "signal %d: stopping", sig);
             _loop.Stop();
             break;
-        case SIGHUP:
+        case zepatools::DaemonSignal::RELOAD:
             Reload();
             break;
-        case SIGCHLD:
+        case zepatools::DaemonSignal::CHILD_EXITED:
             // The tunnel reaps its own children first: it needs their end.
             _tunnel.OnChildExited();
             ReapChildren();
             break;
-        case SIGUSR2:
+        case zepatools::DaemonSignal::TUNNEL_UP:
             _tunnel.OnUpSignal();
             break;
-        default:
-            // SIGUSR1 comes this way only before the dump handler took it over
+        case zepatools::DaemonSignal::DEBUG_DUMP:
+            // Comes this way only before the dump handler took it over
             // (debug_dump.h); that query then sees no answer and may ask again.
+        case zepatools::DaemonSignal::OTHER:
             // SIGPIPE, SIGALRM, SIGRTMIN+5: their handlers only have to exist;
             // nothing to do here.
             RLOG(LOG_DEBUG, "signal %d ignored", sig);

@@ -26,10 +26,6 @@
 
 namespace zeparelayd {
 
-// The signal that makes the daemon reopen its log file (after rotation) and
-// nothing else: SIGRTMIN+2 (SIGUSR2 belongs to the tunnel).
-int ReopenLogSignal();
-
 // "log_level" and "log_file" of a configuration through Daemon::SetLogFile;
 // the file is an appliance path, taken below the system root.
 void ApplyLogSettings(const ZEPA::Relay::RelaydConf& conf);
@@ -63,7 +59,8 @@ public:
     // Status file with state "starting", the debug dump handler, then the
     // first registration.
     bool Start();
-    // What each signal asks of the daemon; stop signals end the loop.
+    // What each signal asks of the daemon (relayd_protocol.h); stop signals
+    // end the loop.
     void HandleSignal(int sig);
     // After every round of events: the status file (written when it changed)
     // and what SIGUSR1 will write.

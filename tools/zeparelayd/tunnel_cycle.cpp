@@ -10,6 +10,7 @@
 #include <cerrno>
 
 #include "log.h"
+#include "relayd_protocol.h"
 #include "server_answer.h"
 
 using namespace ZEPA::Relay;
@@ -365,16 +366,17 @@ void TunnelCycle::Teardown(bool waitForChild) {
 }
 
 Json::Value TunnelCycle::Status() const {
+    namespace key = zepatools::status_key;
     Json::Value out(Json::objectValue);
-    out["connect"] = _mode;
+    out[key::kConnect] = _mode;
     if (!_tunnel) return out;
-    Json::Value& tunnel = out["tunnel"];
+    Json::Value& tunnel = out[key::kTunnel];
     _tunnel->Write(tunnel, true);
     // Up only while a peer address is known: a reconnecting openvpn is not.
-    if (_linkDown) tunnel["status"] = Tunnel::GetStatusStr(TUNNEL_STATUS_NONE);
-    tunnel["peer_ip"] = _peer;
-    tunnel["failures"] = _policy.Failures();
-    if (_starting) tunnel["starting"] = _protocol;
+    if (_linkDown) tunnel[key::kTunnelStatus] = Tunnel::GetStatusStr(TUNNEL_STATUS_NONE);
+    tunnel[key::kTunnelPeerIp] = _peer;
+    tunnel[key::kTunnelFailures] = _policy.Failures();
+    if (_starting) tunnel[key::kTunnelStarting] = _protocol;
     // Never shown, whatever Write does with the section in the future.
     tunnel.removeMember("relay_pass");
     return out;
