@@ -296,7 +296,7 @@ private:
                 RegDone(i, a);
                 break;
             case S_HEARTBEAT:
-                // TunnelCycle's heartbeat: the reregister hook.
+                // TunnelCycle's heartbeat: REGISTER_AGAIN.
                 RegStart(i, a, IsRegistered(a));
                 break;
             case S_ALIAS_TIMER:
@@ -312,8 +312,7 @@ private:
                 TunnelOpened(i, a);
                 break;
             case S_TUNNEL_RETRY:
-                // TunnelCycle's retry timer.
-                a.tunnel.OnAttempt();
+                // TunnelCycle's retry timer: REGISTER_AGAIN.
                 RegStart(i, a, IsRegistered(a));
                 break;
             case S_TUNNEL_CLOSED:
@@ -385,7 +384,7 @@ private:
             return;
         }
         a.registration.OnSuccess();
-        // RelayDaemon::OnRegistered.
+        // RelayDaemon::OnRegistration, REGISTERED.
         TunnelOnRegistered(i, a);
         if (!a.armed[S_ALIAS_TIMER] && !a.armed[S_ALIAS_DONE]) AliasOnRegistered(i, a);
     }
@@ -394,7 +393,6 @@ private:
     void TunnelOnRegistered(uint32_t i, Appliance& a) {
         Cancel(a, S_HEARTBEAT);
         Cancel(a, S_TUNNEL_RETRY);
-        a.tunnel.OnAttempt();
         if (a.tunnelMode) {
             if (a.tunnelExists && a.tunnelUp) {
                 SetState(a, RELAYD_STATE_CONNECTED_ALT);
@@ -470,7 +468,6 @@ private:
 
     // AliasCycle::Run.
     void AliasRun(uint32_t i, Appliance& a, ALIAS_REQUEST_CMD cmd) {
-        a.alias.OnAttempt();
         if (!IsRegistered(a)) return;
         Cancel(a, S_ALIAS_DONE);
         Count(cmd == ALIAS_REQ_MAP ? REQ_ALIAS_MAP : REQ_ALIAS_KEEP_ALIVE);

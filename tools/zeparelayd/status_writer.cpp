@@ -31,6 +31,8 @@ void RelayDaemon::SetState(RELAYD_STATE state, RELAYD_RET error) {
     }
     _state = state;
     _error = error;
+    // An alias exchange that falls due while not registered is skipped.
+    _alias.SetRegistered(IsRegistered());
     // Written after the round (Idle), or at once when the loop has ended.
     if (!_loop.Running()) WriteStatus();
 }
@@ -75,7 +77,7 @@ void RelayDaemon::WriteStatus() {
     status[key::kServerId] = _conf->serverID;
     _conf->WriteServices(status[key::kService], true);
     status[key::kAlias] = _conf->alias.GetAliasName();
-    status[key::kAliasStatus] = _alias.Word();
+    status[key::kAliasStatus] = _aliasWord;
     if (!_configError.empty()) status[key::kConfigError] = _configError;
     const Json::Value connection = _tunnel.Status();
     status[key::kConnect] = connection[key::kConnect];
@@ -83,7 +85,7 @@ void RelayDaemon::WriteStatus() {
     AddTimes(status);
     if (status == _lastStatus) return;
     if (RelaydConf::WriteJsonFile(Daemon::GetStatusPath(), status)) _lastStatus = status;
-    NotifyStatus(ServiceStatusLine(GetStateStr(_state), GetErrorStr(_error), _alias.Word()));
+    NotifyStatus(ServiceStatusLine(GetStateStr(_state), GetErrorStr(_error), _aliasWord));
 }
 
 Json::Value RelayDaemon::DebugDump() const {

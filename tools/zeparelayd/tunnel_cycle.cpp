@@ -44,17 +44,26 @@ void ResetSignalsForChild() {
 
 }  // namespace
 
-TunnelCycle::TunnelCycle(EventLoop& loop, const Clock& clock, Hooks hooks, RandomSource random)
+TunnelCycle::TunnelCycle(EventLoop& loop, const Clock& clock, OutcomeHandler onOutcome, RandomSource random)
     : _loop(loop),
       _clock(clock),
       _policy(clock, std::move(random)),
-      _hooks(std::move(hooks)),
+      _onOutcome(std::move(onOutcome)),
       _heartbeatSeconds(0),
       _upWaitMs(UP_WAIT_MS),
       _starting(false),
       _startDeferred(false),
       _startedMs(0),
       _linkDown(false) {}
+
+void TunnelCycle::Deliver(TunnelOutcome::Kind kind, RELAYD_RET error, int64_t retryMs) {
+    if (!_onOutcome) return;
+    TunnelOutcome outcome;
+    outcome.kind = kind;
+    outcome.error = error;
+    outcome.retryMs = retryMs;
+    _onOutcome(outcome);
+}
 
 bool TunnelCycle::IsUp() const {
     return _tunnel && !_starting && _tunnel->GetStatus() == TUNNEL_STATUS_READY && !_peer.empty() &&
@@ -64,7 +73,6 @@ bool TunnelCycle::IsUp() const {
 void TunnelCycle::OnRegistered(const Json::Value& answer) {
     _loop.CancelTimer(kHeartbeatTimer);
     _loop.CancelTimer(kRetryTimer);
-    _policy.OnAttempt();
     int beat = 0;
     _heartbeatSeconds = AnswerInt(answer, "heartbeat", beat) && beat > 0 ? beat : 0;
     _mode.clear();
@@ -76,11 +84,11 @@ void TunnelCycle::OnRegistered(const Json::Value& answer) {
             (_starting || (_tunnel->IsAlive() && _tunnel->GetStatus() == TUNNEL_STATUS_READY))) {
             // A heartbeat that changes nothing keeps the tunnel, or the start
             // under way.
-            _hooks.setState(IsUp() ? RELAYD_STATE_CONNECTED_ALT : RELAYD_STATE_CONNECTED, RELAYD_SUCCESS);
+            Deliver(IsUp() ? TunnelOutcome::UP : TunnelOutcome::REGISTERED);
         } else {
             Teardown(false);
             _tunnel.reset(new Tunnel(next));
-            _hooks.setState(RELAYD_STATE_CONNECTED, RELAYD_SUCCESS);
+            Deliver(TunnelOutcome::REGISTERED);
             // Opened from a timer, so that the state above is out first.
             _loop.SetTimer(kOpenTimer, 0, [this] { Open(); });
         }
@@ -91,8 +99,7 @@ void TunnelCycle::OnRegistered(const Json::Value& answer) {
         Teardown(false);
         _tunnel.reset();
         _policy.Reset();
-        _hooks.setState(_mode == "direct" ? RELAYD_STATE_DIRECT_CONNECT : RELAYD_STATE_CONNECTED,
-                        RELAYD_SUCCESS);
+        Deliver(_mode == "direct" ? TunnelOutcome::DIRECT : TunnelOutcome::REGISTERED);
     }
     ScheduleHeartbeat();
 }
@@ -101,7 +108,7 @@ void TunnelCycle::ScheduleHeartbeat() {
     if (_heartbeatSeconds <= 0) return;
     _loop.SetTimer(kHeartbeatTimer, static_cast<int64_t>(_heartbeatSeconds) * 1000, [this] {
         RLOG(LOG_DEBUG, "heartbeat: registering again");
-        _hooks.reregister();
+        Deliver(TunnelOutcome::REGISTER_AGAIN);
     });
 }
 
@@ -186,7 +193,7 @@ void TunnelCycle::OnUpSignal() {
         if (_linkDown) {
             _linkDown = false;
             RLOG(LOG_NOTICE, "tunnel to [%s] is back, peer [%s]", _tunnel->relay_ip.c_str(), peer.c_str());
-            _hooks.setState(RELAYD_STATE_CONNECTED_ALT, RELAYD_SUCCESS);
+            Deliver(TunnelOutcome::UP);
         }
     }
 }
@@ -225,7 +232,7 @@ void TunnelCycle::Up(const std::string& peer) {
     _policy.OnUp();
     RLOG(LOG_NOTICE, "tunnel up in %lld ms over %s, pid %d, peer [%s]",
          static_cast<long long>(_clock.NowMs() - _startedMs), _protocol.c_str(), _tunnel->pid, _peer.c_str());
-    _hooks.setState(RELAYD_STATE_CONNECTED_ALT, RELAYD_SUCCESS);
+    Deliver(TunnelOutcome::UP);
     _loop.SetTimer(kLinkTimer, LINK_CHECK_MS, [this] { CheckLink(); });
 }
 
@@ -237,12 +244,12 @@ void TunnelCycle::CheckLink() {
     if (peer.empty() && !_linkDown) {
         _linkDown = true;
         RLOG(LOG_WARNING, "tunnel to [%s] lost its link: openvpn reconnects", _tunnel->relay_ip.c_str());
-        _hooks.setState(RELAYD_STATE_CONNECTED, RELAYD_ERR_NETWORK);
+        Deliver(TunnelOutcome::LINK_LOST, RELAYD_ERR_NETWORK);
     } else if (!peer.empty() && _linkDown) {
         _linkDown = false;
         _peer = peer;
         RLOG(LOG_NOTICE, "tunnel to [%s] is back, peer [%s]", _tunnel->relay_ip.c_str(), peer.c_str());
-        _hooks.setState(RELAYD_STATE_CONNECTED_ALT, RELAYD_SUCCESS);
+        Deliver(TunnelOutcome::UP);
     }
     _loop.SetTimer(kLinkTimer, LINK_CHECK_MS, [this] { CheckLink(); });
 }
@@ -252,11 +259,8 @@ void TunnelCycle::Failed(RELAYD_RET error) {
     const int64_t delay = _policy.OnFailure();
     RLOG(LOG_INFO, "tunnel retry %d in %lld ms", _policy.Failures(), static_cast<long long>(delay));
     _loop.CancelTimer(kHeartbeatTimer);
-    _hooks.setState(RELAYD_STATE_LOGIN, error);
-    _loop.SetTimer(kRetryTimer, delay, [this] {
-        _policy.OnAttempt();
-        _hooks.reregister();
-    });
+    _loop.SetTimer(kRetryTimer, delay, [this] { Deliver(TunnelOutcome::REGISTER_AGAIN); });
+    Deliver(TunnelOutcome::FAILED, error, delay);
 }
 
 // True once the child is gone (reaped here, or by someone else before).
@@ -390,6 +394,7 @@ void TunnelCycle::Dump(Json::Value& out) const {
     out["up_wait_ms"] = static_cast<Json::Int64>(_loop.TimerRemaining(kUpWaitTimer));
     out["ending"] = static_cast<Json::UInt>(_ending.size());
     _policy.Dump(out["retry"]);
+    out["retry"]["retry_in_ms"] = static_cast<Json::Int64>(_loop.TimerRemaining(kRetryTimer));
 }
 
 }  // namespace zeparelayd

@@ -21,6 +21,9 @@
 // torn down, the state is 3 with "err_network", and the daemon registers again
 // after TunnelPolicy's back-off with jitter, which also fetches fresh
 // credentials. "heartbeat": N in the answer registers again after N seconds.
+//
+// The cycle reports each of these as a TunnelOutcome; the daemon makes the
+// state of it and starts the registration when asked to.
 #ifndef ZEPARELAYD_TOOL_TUNNEL_CYCLE_H
 #define ZEPARELAYD_TOOL_TUNNEL_CYCLE_H
 
@@ -43,6 +46,22 @@
 
 namespace zeparelayd {
 
+// What the way the appliance is reached came to.
+struct TunnelOutcome {
+    enum Kind {
+        DIRECT,          // reached directly, no tunnel (state 4)
+        REGISTERED,      // registered only, or a tunnel on its way (state 5)
+        UP,              // the tunnel carries traffic (state 6)
+        LINK_LOST,       // openvpn reconnects after losing its link (state 5, "err_network")
+        FAILED,          // the tunnel failed to open or closed (state 3); error says why,
+                         // retryMs when the daemon registers again
+        REGISTER_AGAIN,  // heartbeat or reconnection due: register now
+    };
+    Kind kind = REGISTERED;
+    ZEPA::Relay::RELAYD_RET error = ZEPA::Relay::RELAYD_SUCCESS;
+    int64_t retryMs = -1;
+};
+
 class TunnelCycle {
 public:
     // How long a started openvpn has to report a peer address.
@@ -52,14 +71,9 @@ public:
     // How often a tunnel that is up is checked for its peer address.
     static constexpr int64_t LINK_CHECK_MS = 1000;
 
-    struct Hooks {
-        std::function<void(ZEPA::Relay::RELAYD_STATE, ZEPA::Relay::RELAYD_RET)> setState;
-        // Register with the control server again (heartbeat, or reconnection
-        // once the back-off has passed).
-        std::function<void()> reregister;
-    };
+    using OutcomeHandler = std::function<void(const TunnelOutcome&)>;
 
-    TunnelCycle(EventLoop& loop, const Clock& clock, Hooks hooks, RandomSource random);
+    TunnelCycle(EventLoop& loop, const Clock& clock, OutcomeHandler onOutcome, RandomSource random);
 
     // Tests shorten the wait for the up script.
     void SetUpWaitMs(int64_t ms) { _upWaitMs = ms; }
@@ -98,6 +112,8 @@ private:
     void Up(const std::string& peer);
     void CheckLink();
     void Failed(ZEPA::Relay::RELAYD_RET error);
+    void Deliver(TunnelOutcome::Kind kind, ZEPA::Relay::RELAYD_RET error = ZEPA::Relay::RELAYD_SUCCESS,
+                 int64_t retryMs = -1);
     void ScheduleHeartbeat();
     void Teardown(bool waitForChild);
     void EndChild(pid_t pid);
@@ -107,7 +123,7 @@ private:
     EventLoop& _loop;
     const Clock& _clock;
     TunnelPolicy _policy;
-    Hooks _hooks;
+    OutcomeHandler _onOutcome;
     std::string _mode;  // "direct", "tunnel" or empty, from the last answer
     std::unique_ptr<ZEPA::Relay::Tunnel> _tunnel;
     std::string _peer;
