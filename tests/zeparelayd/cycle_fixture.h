@@ -4,6 +4,7 @@
 #ifndef ZEPARELAYD_TEST_CYCLE_FIXTURE_H
 #define ZEPARELAYD_TEST_CYCLE_FIXTURE_H
 
+#include <curl/curl.h>
 #include <gtest/gtest.h>
 #include <json/reader.h>
 #include <json/value.h>
@@ -80,6 +81,27 @@ protected:
         Json::Value value;
         Json::Reader().parse(in, value);
         return value;
+    }
+
+    // A plain POST of a JSON body to the local server's HTTP side (its admin
+    // calls); the HTTP status, or 0 when the transfer failed.
+    long Post(const std::string& path, const Json::Value& body) const {
+        CURL* curl = curl_easy_init();
+        if (curl == nullptr) return 0;
+        const std::string url = server.httpUrl(path);
+        const std::string text = Json::FastWriter().write(body);
+        curl_slist* headers = curl_slist_append(nullptr, "Content-Type: application/json");
+        curl_easy_setopt(curl, CURLOPT_URL, url.c_str());
+        curl_easy_setopt(curl, CURLOPT_POSTFIELDS, text.c_str());
+        curl_easy_setopt(curl, CURLOPT_HTTPHEADER, headers);
+        curl_easy_setopt(curl, CURLOPT_TIMEOUT, 10L);
+        curl_easy_setopt(
+            curl, CURLOPT_WRITEFUNCTION, +[](char*, size_t size, size_t n, void*) { return size * n; });
+        long code = 0;
+        if (curl_easy_perform(curl) == CURLE_OK) curl_easy_getinfo(curl, CURLINFO_RESPONSE_CODE, &code);
+        curl_slist_free_all(headers);
+        curl_easy_cleanup(curl);
+        return code;
     }
 
     // Steps the loop until cond holds or maxMs of real time pass; whether it held.
