@@ -113,6 +113,9 @@ TEST_F(RelayDaemonCoreTest, DirectAnswerIsStateFour) {
     // without a change of state.
     const size_t before = server.requests(PAGE).size();
     AdvanceAndRun(3600000);
+    // The status of the round in which the heartbeat went out.
+    loop.RunOnce(0);
+    EXPECT_EQ(RELAYD_STATE_DIRECT_CONNECT, Status()["state"].asInt());
     ASSERT_TRUE(Pump([&] { return server.requests(PAGE).size() > before; }));
     ASSERT_TRUE(StatusSays(RELAYD_STATE_DIRECT_CONNECT, RELAYD_SUCCESS));
 }
