@@ -9,6 +9,7 @@
 
 #include <cerrno>
 
+#include "link_watch.h"
 #include "log.h"
 #include "relayd_protocol.h"
 #include "server_answer.h"
@@ -126,6 +127,7 @@ void TunnelCycle::Open() {
     _tunnel->pid = -1;
     _starting = true;
     _linkDown = false;
+    _link.Stop();
     _peer.clear();
     _protocols = {"udp", "tcp"};
     _startedMs = _clock.NowMs();
@@ -230,6 +232,7 @@ void TunnelCycle::Up(const std::string& peer) {
     _tunnel->status = TUNNEL_STATUS_READY;
     _peer = peer;
     _policy.OnUp();
+    _link.Start(_tunnel->pid, _tunnel->relay_ip);
     RLOG(LOG_NOTICE, "tunnel up in %lld ms over %s, pid %d, peer [%s]",
          static_cast<long long>(_clock.NowMs() - _startedMs), _protocol.c_str(), _tunnel->pid, _peer.c_str());
     Deliver(TunnelOutcome::UP);
@@ -237,15 +240,22 @@ void TunnelCycle::Up(const std::string& peer) {
 }
 
 // The down script removes the peer address when openvpn loses its link and
-// restarts; the up script writes it again once the link is back.
+// restarts; the up script writes it again once the link is back. A link that
+// goes down (no route to the relay, or its device without carrier) is seen
+// at once, long before openvpn's ping timeout; it is back when the way is.
 void TunnelCycle::CheckLink() {
     if (!_tunnel || _starting || _tunnel->GetStatus() != TUNNEL_STATUS_READY) return;
     const std::string peer = Tunnel::GetVpnTunnelPeerIp();
-    if (peer.empty() && !_linkDown) {
+    const bool noWay = _link.Check() == LinkWatch::DOWN;
+    if ((peer.empty() || noWay) && !_linkDown) {
         _linkDown = true;
-        RLOG(LOG_WARNING, "tunnel to [%s] lost its link: openvpn reconnects", _tunnel->relay_ip.c_str());
+        if (noWay) {
+            RLOG(LOG_WARNING, "tunnel to [%s] lost its link: no way to the relay", _tunnel->relay_ip.c_str());
+        } else {
+            RLOG(LOG_WARNING, "tunnel to [%s] lost its link: openvpn reconnects", _tunnel->relay_ip.c_str());
+        }
         Deliver(TunnelOutcome::LINK_LOST, RELAYD_ERR_NETWORK);
-    } else if (!peer.empty() && _linkDown) {
+    } else if (!peer.empty() && !noWay && _linkDown) {
         _linkDown = false;
         _peer = peer;
         RLOG(LOG_NOTICE, "tunnel to [%s] is back, peer [%s]", _tunnel->relay_ip.c_str(), peer.c_str());
@@ -327,6 +337,7 @@ void TunnelCycle::Teardown(bool waitForChild) {
     _loop.CancelTimer(kOpenTimer);
     _loop.CancelTimer(kUpWaitTimer);
     _loop.CancelTimer(kLinkTimer);
+    _link.Stop();
     _peer.clear();
     _linkDown = false;
     _starting = false;

@@ -16,11 +16,13 @@
 // The tunnel counts as up only once the up script has published a peer
 // address; a child still running without one after the wait is ended and the
 // attempt counts as failed. A tunnel whose peer address disappears (openvpn
-// restarting its connection after a link loss) is shown as state 5 until the
-// up script reports again. A tunnel that fails to start or closes later is
-// torn down, the state is 3 with "err_network", and the daemon registers again
-// after TunnelPolicy's back-off with jitter, which also fetches fresh
-// credentials. "heartbeat": N in the answer registers again after N seconds.
+// restarting its connection after a link loss), or whose way to the relay
+// goes (no route, or no carrier: link_watch.h), is shown as state 5 with
+// "err_network" until the up script reports again or the way is back. A
+// tunnel that fails to start or closes later is torn down, the state is 3
+// with "err_network", and the daemon registers again after TunnelPolicy's
+// back-off with jitter, which also fetches fresh credentials. "heartbeat": N
+// in the answer registers again after N seconds.
 //
 // The cycle reports each of these as a TunnelOutcome; the daemon makes the
 // state of it and starts the registration when asked to.
@@ -42,6 +44,7 @@
 
 #include "clock.h"
 #include "event_loop.h"
+#include "link_watch.h"
 #include "retry_policy.h"
 
 namespace zeparelayd {
@@ -137,6 +140,7 @@ private:
     std::string _passFile;
     int64_t _startedMs;
     bool _linkDown;
+    LinkWatch _link;  // the way to the relay while up
     std::set<pid_t> _ending;
 };
 
