@@ -115,7 +115,8 @@ public:
         }
         _windowStartMs = _eventMs - config.steadyWindowMs;
         _endMs = _returnMs + config.afterMs;
-        const size_t seconds = static_cast<size_t>((_endMs - _windowStartMs) / SECOND);
+        // A window that does not end on a whole second still counts its last part.
+        const size_t seconds = static_cast<size_t>((_endMs - _windowStartMs + SECOND - 1) / SECOND);
         _perSecond.assign(REQ_KINDS, std::vector<uint32_t>(seconds, 0));
         _recoveredShare.assign(seconds, 0.0f);
         _appliances.reserve(config.appliances);
@@ -808,7 +809,7 @@ Result ResultFromRecords(const RecordedRun& run) {
     r.eventMs = boot + static_cast<int64_t>(run.steadySeconds * SECOND);
     r.returnMs = r.eventMs + static_cast<int64_t>(run.outageSeconds * SECOND);
     const int64_t endMs = r.returnMs + static_cast<int64_t>(run.afterSeconds * SECOND);
-    const size_t seconds = static_cast<size_t>((endMs - r.windowStartMs) / SECOND);
+    const size_t seconds = static_cast<size_t>((endMs - r.windowStartMs + SECOND - 1) / SECOND);
     r.perSecond.assign(REQ_KINDS, std::vector<uint32_t>(seconds, 0));
     r.recoveredShare.assign(seconds, 0.0f);
     std::vector<std::vector<int64_t>> successes(run.appliances);
