@@ -148,6 +148,42 @@ def memory(pid):
     return rss, pss
 
 
+def stop_daemons(roots, grace=10):
+    """SIGTERM to the daemon of each root (only a live zeparelayd named by its
+    PID file), SIGKILL to those left after grace seconds."""
+    for sig, wait in ((signal.SIGTERM, grace), (signal.SIGKILL, 0)):
+        for r in roots:
+            pid = daemon_pid(r)
+            if pid is not None:
+                try:
+                    os.kill(pid, sig)
+                except OSError:
+                    pass
+        deadline = time.time() + wait
+        while time.time() < deadline and any(daemon_pid(r) is not None for r in roots):
+            time.sleep(0.1)
+
+
+def watch(owner, roots_dir):
+    """Stops the fleet once the run that started it is gone, also when it was
+    killed outright (a time-out): the daemons do not outlive their run."""
+    while True:
+        try:
+            with open("/proc/%d/stat" % owner) as f:
+                state = f.read().rsplit(")", 1)[1].split()[0]
+        except (OSError, IndexError):
+            state = "gone"
+        if state in ("Z", "X", "gone"):
+            break
+        time.sleep(1)
+    try:
+        roots = [os.path.join(roots_dir, d) for d in sorted(os.listdir(roots_dir))]
+    except OSError:
+        return 0
+    stop_daemons(roots, 5)
+    return 0
+
+
 def classify(rec):
     """(kind, serial) of a recorded request, or None for other traffic."""
     if rec["path"] == "/Serv.php":
@@ -176,6 +212,8 @@ def answered_ok(rec, kind):
 
 
 def main():
+    if len(sys.argv) == 4 and sys.argv[1] == "--watch":
+        return watch(int(sys.argv[2]), sys.argv[3])
     p = argparse.ArgumentParser(description=__doc__.split("\n")[0])
     p.add_argument("--daemon", required=True, help="the zeparelayd program")
     p.add_argument("-n", "--appliances", type=int, default=200)
@@ -205,12 +243,15 @@ def main():
 
     n, beat = args.appliances, args.heartbeat
     server = None
+    watcher = None
     roots = []
     try:
         say("local server and %d staged roots in %s" % (n, work))
         server = Server(work, max(50000, n * 50))
         server.call("POST", "/relay/admin/heartbeat", {"seconds": beat})
         roots = stage(work, n, server, args.log_level)
+        watcher = subprocess.Popen([sys.executable, os.path.abspath(__file__), "--watch", str(os.getpid()),
+                                    os.path.join(work, "roots")], start_new_session=True)
         server.call("POST", "/_control/reset")
         server.call("POST", "/relay/admin/heartbeat", {"seconds": beat})
         for i in range(n):
@@ -310,23 +351,10 @@ def main():
         sys.stderr.write("real_fleet: %s\n" % exc)
         return 1
     finally:
-        for r in roots:
-            pid = daemon_pid(r)
-            if pid is not None:
-                try:
-                    os.kill(pid, signal.SIGTERM)
-                except OSError:
-                    pass
-        deadline = time.time() + 10
-        while time.time() < deadline and any(daemon_pid(r) is not None for r in roots):
-            time.sleep(0.1)
-        for r in roots:
-            pid = daemon_pid(r)
-            if pid is not None:
-                try:
-                    os.kill(pid, signal.SIGKILL)
-                except OSError:
-                    pass
+        stop_daemons(roots)
+        if watcher is not None:
+            watcher.terminate()
+            watcher.wait()
         if server is not None:
             server.stop()
         if temp is not None:
