@@ -115,7 +115,8 @@ public:
         }
         _windowStartMs = _eventMs - config.steadyWindowMs;
         _endMs = _returnMs + config.afterMs;
-        const size_t seconds = static_cast<size_t>((_endMs - _windowStartMs) / SECOND);
+        // A window that does not end on a whole second still counts its last part.
+        const size_t seconds = static_cast<size_t>((_endMs - _windowStartMs + SECOND - 1) / SECOND);
         _perSecond.assign(REQ_KINDS, std::vector<uint32_t>(seconds, 0));
         _recoveredShare.assign(seconds, 0.0f);
         _appliances.reserve(config.appliances);
@@ -123,8 +124,14 @@ public:
             _appliances.emplace_back(_clock, _random, rules);
             Appliance& a = _appliances.back();
             a.tunnelMode = static_cast<int>(_rng() % 100) < config.tunnelPercent;
-            const int64_t boot = power ? _eventMs + Uniform(0, config.bootSpreadMs)
-                                       : Uniform(0, std::max<int64_t>(config.warmupMs, 1));
+            int64_t boot;
+            if (power) {
+                boot = _eventMs + Uniform(0, config.bootSpreadMs);
+            } else if (config.bootEvenly) {
+                boot = config.warmupMs * i / config.appliances;
+            } else {
+                boot = Uniform(0, std::max<int64_t>(config.warmupMs, 1));
+            }
             Schedule(static_cast<uint32_t>(i), S_BOOT, boot);
         }
         if (scenario.kind == ScenarioKind::OUTAGE) _outageAt = _eventMs;
@@ -206,6 +213,11 @@ private:
     void Cancel(Appliance& a, Slot slot) {
         ++a.generation[slot];
         a.armed[slot] = false;
+    }
+
+    // What a server sees of a request with that answer.
+    bool Reaches(Answer answer) const {
+        return !_config.servedOnly || (answer != Answer::REFUSED && answer != Answer::NO_DNS);
     }
 
     void Count(RequestKind kind) {
@@ -296,7 +308,7 @@ private:
                 RegDone(i, a);
                 break;
             case S_HEARTBEAT:
-                // TunnelCycle's heartbeat: the reregister hook.
+                // TunnelCycle's heartbeat: REGISTER_AGAIN.
                 RegStart(i, a, IsRegistered(a));
                 break;
             case S_ALIAS_TIMER:
@@ -312,8 +324,7 @@ private:
                 TunnelOpened(i, a);
                 break;
             case S_TUNNEL_RETRY:
-                // TunnelCycle's retry timer.
-                a.tunnel.OnAttempt();
+                // TunnelCycle's retry timer: REGISTER_AGAIN.
                 RegStart(i, a, IsRegistered(a));
                 break;
             case S_TUNNEL_CLOSED:
@@ -344,8 +355,8 @@ private:
         Cancel(a, S_REG_DONE);
         a.registration.OnAttempt();
         if (!keepState) SetState(a, RELAYD_STATE_LOGIN);
-        Count(REQ_REGISTER);
         const Answer answer = ControlServer(a);
+        if (Reaches(answer)) Count(REQ_REGISTER);
         switch (answer) {
             case Answer::OK:
                 a.regOutcome = RELAYD_SUCCESS;
@@ -385,7 +396,7 @@ private:
             return;
         }
         a.registration.OnSuccess();
-        // RelayDaemon::OnRegistered.
+        // RelayDaemon::OnRegistration, REGISTERED.
         TunnelOnRegistered(i, a);
         if (!a.armed[S_ALIAS_TIMER] && !a.armed[S_ALIAS_DONE]) AliasOnRegistered(i, a);
     }
@@ -394,7 +405,6 @@ private:
     void TunnelOnRegistered(uint32_t i, Appliance& a) {
         Cancel(a, S_HEARTBEAT);
         Cancel(a, S_TUNNEL_RETRY);
-        a.tunnel.OnAttempt();
         if (a.tunnelMode) {
             if (a.tunnelExists && a.tunnelUp) {
                 SetState(a, RELAYD_STATE_CONNECTED_ALT);
@@ -423,8 +433,8 @@ private:
     // TunnelCycle::Open: Tunnel::Create(true), UDP first, then TCP.
     void TunnelOpen(uint32_t i, Appliance& a) {
         if (!a.tunnelExists) return;
-        Count(REQ_TUNNEL);
         const Answer answer = TunnelServer();
+        if (Reaches(answer)) Count(REQ_TUNNEL);
         if (answer == Answer::OK) {
             a.tunnelOk = true;
             After(i, S_TUNNEL_DONE, Uniform(1 * SECOND, 3 * SECOND));
@@ -432,7 +442,7 @@ private:
         }
         // UDP gets no answer; its child gives up after its ping time-out. TCP is
         // then refused at once, or hangs until the daemon's wait ends.
-        Count(REQ_TUNNEL);
+        if (Reaches(answer)) Count(REQ_TUNNEL);
         a.tunnelOk = false;
         After(i, S_TUNNEL_DONE, 10 * SECOND + (answer == Answer::HANGS ? TUNNEL_WAIT_MS : Uniform(10, 60)));
     }
@@ -470,11 +480,10 @@ private:
 
     // AliasCycle::Run.
     void AliasRun(uint32_t i, Appliance& a, ALIAS_REQUEST_CMD cmd) {
-        a.alias.OnAttempt();
         if (!IsRegistered(a)) return;
         Cancel(a, S_ALIAS_DONE);
-        Count(cmd == ALIAS_REQ_MAP ? REQ_ALIAS_MAP : REQ_ALIAS_KEEP_ALIVE);
         const Answer answer = AliasServer();
+        if (Reaches(answer)) Count(cmd == ALIAS_REQ_MAP ? REQ_ALIAS_MAP : REQ_ALIAS_KEEP_ALIVE);
         a.aliasCmd = cmd;
         a.aliasOutcome = answer == Answer::OK       ? ALIAS_RET_SUCCESS
                          : answer == Answer::NO_DNS ? ALIAS_RET_DNS
@@ -771,6 +780,172 @@ Result RunScenario(const FleetConfig& config, const Rules& rules, const Scenario
     const Result* reference = scenario.kind == ScenarioKind::POWER_RESTORE ? steadyFrom : nullptr;
     for (int s = 0; s < 5; ++s) r.series.push_back(Figures(r, s, reference));
     return r;
+}
+
+bool ReadRecordedRun(const std::string& path, RecordedRun& out, std::string& error) {
+    std::ifstream in(path);
+    if (!in) {
+        error = path + ": cannot be read";
+        return false;
+    }
+    out = RecordedRun();
+    std::string line;
+    bool header = false, columns = false;
+    int lineNo = 0;
+    while (std::getline(in, line)) {
+        ++lineNo;
+        if (line.rfind("# real fleet:", 0) == 0) {
+            char rest[64] = "";
+            header = sscanf(line.c_str(),
+                            "# real fleet: appliances %d heartbeat %d boot_spread %lf steady %lf outage %lf "
+                            "after %lf%63s",
+                            &out.appliances, &out.heartbeatSeconds, &out.bootSpreadSeconds,
+                            &out.steadySeconds, &out.outageSeconds, &out.afterSeconds, rest) == 6;
+            continue;
+        }
+        if (line.rfind("#", 0) == 0) {
+            out.notes.push_back(line.substr(line.find_first_not_of("# ")));
+            continue;
+        }
+        if (!columns) {
+            columns = line == "seconds_from_event,kind,appliance,ok";
+            if (!columns) break;
+            continue;
+        }
+        std::istringstream fields(line);
+        std::string t, kind, appliance, ok;
+        if (!std::getline(fields, t, ',') || !std::getline(fields, kind, ',') ||
+            !std::getline(fields, appliance, ',') || !std::getline(fields, ok)) {
+            error = path + ":" + std::to_string(lineNo) + ": not time,kind,appliance,ok";
+            return false;
+        }
+        RecordedRequest r;
+        char* end = nullptr;
+        r.secondsFromEvent = strtod(t.c_str(), &end);
+        const bool timeOk = end != t.c_str() && *end == '\0';
+        r.kind = -1;
+        for (int k = 0; k < REQ_KINDS; ++k) {
+            if (kind == KindName(k)) r.kind = k;
+        }
+        r.appliance = atoi(appliance.c_str());
+        r.ok = ok == "1";
+        if (!timeOk || r.kind < 0 || r.appliance < 0 || r.appliance >= out.appliances) {
+            error = path + ":" + std::to_string(lineNo) + ": bad request line '" + line + "'";
+            return false;
+        }
+        out.requests.push_back(r);
+    }
+    if (!header || !columns || out.appliances < 1 || out.heartbeatSeconds < 1 || out.steadySeconds <= 0 ||
+        out.outageSeconds <= 0 || out.afterSeconds <= 0) {
+        error = path + ": not a record of real_fleet.py (header or column line missing or wrong)";
+        return false;
+    }
+    return true;
+}
+
+Result ResultFromRecords(const RecordedRun& run) {
+    Result r;
+    r.scenario = MatchingScenario(run);
+    r.rules.name = "real daemons";
+    r.appliances = run.appliances;
+    const int64_t boot = static_cast<int64_t>(run.bootSpreadSeconds * SECOND);
+    r.windowStartMs = boot;
+    r.eventMs = boot + static_cast<int64_t>(run.steadySeconds * SECOND);
+    r.returnMs = r.eventMs + static_cast<int64_t>(run.outageSeconds * SECOND);
+    const int64_t endMs = r.returnMs + static_cast<int64_t>(run.afterSeconds * SECOND);
+    const size_t seconds = static_cast<size_t>((endMs - r.windowStartMs + SECOND - 1) / SECOND);
+    r.perSecond.assign(REQ_KINDS, std::vector<uint32_t>(seconds, 0));
+    r.recoveredShare.assign(seconds, 0.0f);
+    std::vector<std::vector<int64_t>> successes(run.appliances);
+    for (const RecordedRequest& q : run.requests) {
+        const int64_t at = r.eventMs + static_cast<int64_t>(std::llround(q.secondsFromEvent * SECOND));
+        ++r.events;
+        if (at >= r.windowStartMs && at < endMs) {
+            ++r.perSecond[q.kind][static_cast<size_t>((at - r.windowStartMs) / SECOND)];
+        }
+        if (q.kind == REQ_REGISTER && q.ok) successes[q.appliance].push_back(at);
+    }
+    // Connected from each success until the heartbeat after it did not come
+    // (a refused attempt), or for good when the next success came in time.
+    const int64_t beat = static_cast<int64_t>(run.heartbeatSeconds) * SECOND;
+    const int64_t grace = 10 * SECOND;
+    std::vector<std::pair<int64_t, int>> changes;
+    for (std::vector<int64_t>& s : successes) {
+        std::sort(s.begin(), s.end());
+        for (size_t k = 0; k < s.size(); ++k) {
+            const bool inTime = k + 1 < s.size() && s[k + 1] <= s[k] + beat + grace;
+            if (k == 0 || s[k] > s[k - 1] + beat + grace) changes.emplace_back(s[k], +1);
+            if (!inTime && s[k] + beat < endMs) {
+                // Gone from the missed heartbeat, unless that is past the end.
+                if (k + 1 < s.size() || s[k] + beat + grace < endMs) changes.emplace_back(s[k] + beat, -1);
+            }
+        }
+    }
+    std::sort(changes.begin(), changes.end());
+    int count = 0;
+    size_t next = 0;
+    const double need[3] = {std::ceil(0.5 * run.appliances), std::ceil(0.99 * run.appliances),
+                            static_cast<double>(run.appliances)};
+    double reached[3] = {-1, -1, -1};
+    bool referenceSeen = false;
+    auto thresholds = [&](int64_t at) {
+        if (at < r.returnMs) return;
+        for (int k = 0; k < 3; ++k) {
+            if (reached[k] < 0 && count >= need[k])
+                reached[k] = static_cast<double>(at - r.returnMs) / SECOND;
+        }
+    };
+    for (size_t sec = 0; sec < seconds; ++sec) {
+        const int64_t until = r.windowStartMs + static_cast<int64_t>(sec + 1) * SECOND;
+        while (next < changes.size() && changes[next].first < until) {
+            if (!referenceSeen && changes[next].first >= r.returnMs) {
+                referenceSeen = true;
+                r.recoveredAtReference = static_cast<double>(count) / run.appliances;
+                thresholds(r.returnMs);
+            }
+            count += changes[next].second;
+            thresholds(changes[next].first);
+            ++next;
+        }
+        if (!referenceSeen && until > r.returnMs) {
+            referenceSeen = true;
+            r.recoveredAtReference = static_cast<double>(count) / run.appliances;
+            thresholds(r.returnMs);
+        }
+        r.recoveredShare[sec] = static_cast<float>(count) / run.appliances;
+    }
+    r.recover50 = reached[0];
+    r.recover99 = reached[1];
+    r.recover100 = reached[2];
+    for (int s = 0; s < 5; ++s) r.series.push_back(Figures(r, s, nullptr));
+    return r;
+}
+
+FleetConfig MatchingConfig(const RecordedRun& run, uint64_t seed) {
+    FleetConfig c;
+    c.appliances = run.appliances;
+    c.seed = seed;
+    c.heartbeatSeconds = run.heartbeatSeconds;
+    c.tunnelPercent = 0;
+    c.warmupMs = static_cast<int64_t>(run.bootSpreadSeconds * SECOND);
+    c.steadyWindowMs = static_cast<int64_t>(run.steadySeconds * SECOND);
+    c.afterMs = static_cast<int64_t>(run.afterSeconds * SECOND);
+    c.bootEvenly = true;
+    c.servedOnly = true;
+    return c;
+}
+
+Rules MatchingRules() {
+    Rules r;
+    r.name = "shipped, no start-up spread";
+    r.registration.startSpreadMs = 0;
+    return r;
+}
+
+Scenario MatchingScenario(const RecordedRun& run) {
+    char name[64];
+    snprintf(name, sizeof name, "outage-%.0fs-refused", run.outageSeconds);
+    return {name, ScenarioKind::OUTAGE, static_cast<int64_t>(run.outageSeconds * SECOND), false};
 }
 
 std::vector<std::string> CheckGoals(const Result& r) {

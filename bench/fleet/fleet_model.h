@@ -53,6 +53,12 @@ struct FleetConfig {
     int64_t steadyWindowMs = 3600 * 1000;  // measured before the disturbance
     int64_t bootSpreadMs = 60000;          // power restore: every appliance boots within this
     int64_t afterMs = 3600 * 1000;         // measured after the return
+    // Boots one after another at even steps over the warm-up, as a harness
+    // starts a fleet of real daemons, instead of at random moments.
+    bool bootEvenly = false;
+    // Counts only the requests that reached a server, as the server's own
+    // records do: a refused connection or a failed name lookup is not seen.
+    bool servedOnly = false;
 };
 
 // Figures of one request series (a kind, or a server's sum of kinds).
@@ -90,6 +96,44 @@ struct Result {
 // without a steady phase of its own (power restore) is measured against.
 Result RunScenario(const FleetConfig& config, const Rules& rules, const Scenario& scenario,
                    const Result* steadyFrom = nullptr);
+
+// A fleet measured elsewhere: real daemons against the local server, as
+// bench/fleet/real_fleet.py records them from the server's own records.
+struct RecordedRequest {
+    double secondsFromEvent = 0;  // arrival, from the start of the outage
+    int kind = REQ_REGISTER;
+    int appliance = 0;
+    bool ok = false;  // the answer was a success
+};
+
+struct RecordedRun {
+    int appliances = 0;
+    int heartbeatSeconds = 0;
+    double bootSpreadSeconds = 0;  // the daemons started evenly over this
+    double steadySeconds = 0;      // from the last start to the outage
+    double outageSeconds = 0;      // refused from the event to the return
+    double afterSeconds = 0;       // measured after the return
+    std::vector<RecordedRequest> requests;
+    std::vector<std::string> notes;  // the file's other comment lines, as written
+};
+
+// Reads the CSV of real_fleet.py; false with a reason when it is not one.
+bool ReadRecordedRun(const std::string& path, RecordedRun& out, std::string& error);
+
+// The figures of a recorded outage, computed as for a simulated one. The
+// server sees no refused attempt, so an appliance counts as disconnected
+// from its first heartbeat that did not arrive (its last success plus the
+// heartbeat, and a few seconds' grace) until its next successful registration.
+Result ResultFromRecords(const RecordedRun& run);
+
+// The simulated fleet that matches a recorded one: its size, heartbeat,
+// even boots over the same spread, steady window, outage and time after; no
+// tunnels; counting only what reaches the server; the shipped rules without
+// the start-up spread, which a daemon started long after the machine's boot
+// does not wait.
+FleetConfig MatchingConfig(const RecordedRun& run, uint64_t seed);
+Rules MatchingRules();
+Scenario MatchingScenario(const RecordedRun& run);
 
 // The goals, scaled to nothing: the ratios and times do not depend on the
 // fleet's size. One line per goal not met; empty when all are.

@@ -4,9 +4,11 @@
 #include <sys/stat.h>
 
 #include <cerrno>
+#include <cmath>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <functional>
 #include <string>
 #include <vector>
 
@@ -30,7 +32,13 @@ void Usage(FILE* out) {
         "  --warmup-hours H       boots of the steady fleet spread over H hours (default 16)\n"
         "  --csv-dir DIR          write DIR/<scenario>.csv (per second: requests per kind, recovered share)\n"
         "  --check                exit 1 when a goal is not met (each miss is printed)\n"
-        "  --list                 print the scenarios and rule variants\n");
+        "  --list                 print the scenarios and rule variants\n"
+        "  --records FILE         figures of a real fleet (bench/fleet/real_fleet.py) beside the simulated\n"
+        "                         fleet of the same set-up; with --check, exit 1 when the real fleet\n"
+        "                         misses a goal (99 %% back within 300 s, peak/steady within --peak-limit,\n"
+        "                         no lock-step)\n"
+        "  --seeds K              simulated runs beside a real fleet (default 10)\n"
+        "  --peak-limit X         the real fleet's peak/steady goal (default 2)\n");
 }
 
 bool ParseInt(const char* text, long long lo, long long hi, long long& out) {
@@ -67,6 +75,132 @@ double WorstTime(double a, double b) {
     return std::max(a, b);
 }
 
+struct Spread {
+    double mean = 0, lo = 0, hi = 0;
+    int never = 0;
+};
+
+Spread Over(const std::vector<fleet::Result>& runs, const std::function<double(const fleet::Result&)>& get) {
+    Spread s;
+    int n = 0;
+    for (const fleet::Result& r : runs) {
+        const double v = get(r);
+        if (v < 0) {
+            ++s.never;
+            continue;
+        }
+        s.lo = n == 0 ? v : std::min(s.lo, v);
+        s.hi = n == 0 ? v : std::max(s.hi, v);
+        s.mean += v;
+        ++n;
+    }
+    if (n > 0) s.mean /= n;
+    return s;
+}
+
+double PeakRatio(const fleet::Result& r) {
+    const fleet::SeriesFigures& f = r.Series("register");
+    return f.steady > 0 ? f.peak / f.steady : -1;
+}
+
+// One row: the real value, the simulated runs' mean and range, and whether
+// the two are within 20 % of each other.
+void Row(const char* what, double real, const Spread& sim, const char* unit, bool compare) {
+    char realText[32], simText[64], verdict[32] = "";
+    if (real < 0) {
+        snprintf(realText, sizeof realText, "never");
+    } else {
+        snprintf(realText, sizeof realText, "%.2f%s", real, unit);
+    }
+    snprintf(simText, sizeof simText, "%.2f%s (%.2f-%.2f)%s", sim.mean, unit, sim.lo, sim.hi,
+             sim.never ? " +never" : "");
+    if (compare && real >= 0 && sim.mean > 0) {
+        const double off = real / sim.mean - 1;
+        snprintf(verdict, sizeof verdict, "%+.0f %%%s", 100 * off, std::fabs(off) <= 0.2 ? "" : "  (> 20 %)");
+    }
+    printf("  %-34s %12s   %-28s %s\n", what, realText, simText, verdict);
+}
+
+int CompareRecorded(const std::string& path, int seeds, double peakLimit, bool check) {
+    fleet::RecordedRun run;
+    std::string error;
+    if (!fleet::ReadRecordedRun(path, run, error)) {
+        fprintf(stderr, "fleet_sim: %s\n", error.c_str());
+        return 1;
+    }
+    const fleet::Result real = fleet::ResultFromRecords(run);
+    fflush(stdout);
+    fprintf(stderr, "simulating the same set-up, %d seeds ...\n", seeds);
+    std::vector<fleet::Result> sims;
+    const fleet::Rules rules = fleet::MatchingRules();
+    const fleet::Scenario scenario = fleet::MatchingScenario(run);
+    for (int seed = 1; seed <= seeds; ++seed) {
+        const fleet::FleetConfig config = fleet::MatchingConfig(run, static_cast<uint64_t>(seed));
+        sims.push_back(fleet::RunScenario(config, rules, scenario));
+    }
+    printf(
+        "== real fleet: %d zeparelayd against one local server, heartbeat %d s, started evenly over %.0f s,\n"
+        "   steady %.0f s, control server refusing for %.1f s, %.0f s measured after its return; no "
+        "tunnels\n",
+        run.appliances, run.heartbeatSeconds, run.bootSpreadSeconds, run.steadySeconds, run.outageSeconds,
+        run.afterSeconds);
+    for (const std::string& note : run.notes) printf("   %s\n", note.c_str());
+    printf("%s", fleet::FormatResult(real).c_str());
+    printf("\n== beside the simulator (same set-up, rules \"%s\", %d seeds; requests the server saw)\n",
+           rules.name.c_str(), seeds);
+    printf("  %-34s %12s   %-28s %s\n", "", "real", "simulated: mean (range)", "real/sim");
+    for (const char* kind : {"register", "alias_map"}) {
+        const std::string k = kind;
+        Row((k + " steady /s").c_str(), real.Series(k).steady,
+            Over(sims, [&](const fleet::Result& r) { return r.Series(k).steady; }), "", false);
+        Row((k + " peak /s (60 s mean)").c_str(), real.Series(k).peak,
+            Over(sims, [&](const fleet::Result& r) { return r.Series(k).peak; }), "", k == "register");
+    }
+    Row("register peak/steady", PeakRatio(real), Over(sims, PeakRatio), "x", true);
+    Row("connected at the return", 100 * real.recoveredAtReference,
+        Over(sims, [](const fleet::Result& r) { return 100 * r.recoveredAtReference; }), " %", false);
+    Row("50 % connected again after", real.recover50,
+        Over(sims, [](const fleet::Result& r) { return r.recover50; }), " s", true);
+    Row("99 % connected again after", real.recover99,
+        Over(sims, [](const fleet::Result& r) { return r.recover99; }), " s", true);
+    Row("100 % connected again after", real.recover100,
+        Over(sims, [](const fleet::Result& r) { return r.recover100; }), " s", true);
+    bool realLockStep = false;
+    for (const fleet::SeriesFigures& f : real.series) realLockStep = realLockStep || f.lockStep;
+    int simLockStep = 0;
+    for (const fleet::Result& r : sims) {
+        bool any = false;
+        for (const fleet::SeriesFigures& f : r.series) any = any || f.lockStep;
+        simLockStep += any ? 1 : 0;
+    }
+    printf("  %-34s %12s   %d of %d runs\n", "lock-step", realLockStep ? "yes" : "no", simLockStep, seeds);
+
+    std::vector<std::string> missed;
+    char buf[256];
+    if (real.recover99 < 0 || real.recover99 > 300) {
+        if (real.recover99 < 0) {
+            snprintf(buf, sizeof buf, "99 %% not connected again within the %.0f s measured (goal <= 300 s)",
+                     run.afterSeconds);
+        } else {
+            snprintf(buf, sizeof buf, "99 %% connected again after %.0f s (goal <= 300 s)", real.recover99);
+        }
+        missed.push_back(buf);
+    }
+    if (PeakRatio(real) < 0 || PeakRatio(real) > peakLimit) {
+        snprintf(buf, sizeof buf, "register peak/steady %.2f (goal <= %.2f)", PeakRatio(real), peakLimit);
+        missed.push_back(buf);
+    }
+    if (realLockStep) missed.push_back("a request kind in lock-step");
+    if (missed.empty()) {
+        printf("\nThe real fleet met the goals (99 %% within 300 s, peak/steady <= %.2f, no lock-step).\n",
+               peakLimit);
+    } else {
+        printf("\nThe real fleet missed goals:\n");
+        for (const std::string& m : missed) printf("  %s\n", m.c_str());
+    }
+    return check && !missed.empty() ? 1 : 0;
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
@@ -75,6 +209,9 @@ int main(int argc, char** argv) {
     std::vector<std::string> rulesNames;
     std::string csvDir;
     bool check = false, variants = false;
+    std::string recordsPath;
+    int seeds = 10;
+    double peakLimit = 2.0;
     for (int i = 1; i < argc; ++i) {
         const std::string arg = argv[i];
         long long v = 0;
@@ -119,6 +256,22 @@ int main(int argc, char** argv) {
             config.warmupMs = v * 3600 * 1000;
         } else if (arg == "--csv-dir") {
             csvDir = Value(argc, argv, i);
+        } else if (arg == "--records") {
+            recordsPath = Value(argc, argv, i);
+        } else if (arg == "--seeds") {
+            if (!ParseInt(Value(argc, argv, i), 1, 1000, v)) {
+                fprintf(stderr, "fleet_sim: --seeds wants 1 to 1000\n");
+                return 64;
+            }
+            seeds = static_cast<int>(v);
+        } else if (arg == "--peak-limit") {
+            const char* text = Value(argc, argv, i);
+            char* end = nullptr;
+            peakLimit = strtod(text, &end);
+            if (end == text || *end != '\0' || !(peakLimit > 0)) {
+                fprintf(stderr, "fleet_sim: --peak-limit wants a positive number\n");
+                return 64;
+            }
         } else if (arg == "--check") {
             check = true;
         } else if (arg == "--list") {
@@ -133,6 +286,8 @@ int main(int argc, char** argv) {
             return 64;
         }
     }
+
+    if (!recordsPath.empty()) return CompareRecorded(recordsPath, seeds, peakLimit, check);
 
     std::vector<fleet::Scenario> scenarios;
     if (names.empty()) {

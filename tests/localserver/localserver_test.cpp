@@ -8,6 +8,7 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <ctime>
 #include <string>
 
 #include "support/local_server.h"
@@ -241,4 +242,81 @@ TEST(LocalServerRoutes, StartFailureIsReported) {
     LocalServer server(options);
     EXPECT_FALSE(server.ok());
     EXPECT_NE(std::string::npos, server.error().find("SyntaxError")) << server.error();
+}
+
+TEST_F(LocalServerTest, RecordsTellWhenARequestCameAndWhatItGot) {
+    const double before = static_cast<double>(time(nullptr)) - 1;
+    Fetch(server.httpUrl("/test/text"));
+    ASSERT_TRUE(server.script("/test/json", 503, "busy now", 1));
+    Fetch(server.httpUrl("/test/json"));
+    Json::Value all = server.requests();
+    ASSERT_EQ(2u, all.size());
+    EXPECT_GE(all[0]["time"].asDouble(), before);
+    EXPECT_LE(all[0]["time"].asDouble(), static_cast<double>(time(nullptr)) + 1);
+    EXPECT_GE(all[0]["answer_time"].asDouble(), all[0]["time"].asDouble());
+    EXPECT_EQ(200, all[0]["answer_status"].asInt());
+    EXPECT_EQ("hello, world\n", all[0]["answer_latin1"].asString());
+    EXPECT_EQ(503, all[1]["answer_status"].asInt());
+    EXPECT_EQ("busy now", all[1]["answer_latin1"].asString());
+    // Only what came after a record number.
+    std::string answer;
+    long status = 0;
+    ASSERT_TRUE(server.control("GET", "requests?since=1", "", answer, status));
+    EXPECT_EQ(200, status);
+    EXPECT_EQ(std::string::npos, answer.find("\"seq\": 1,")) << answer;
+    EXPECT_NE(std::string::npos, answer.find("\"seq\": 2,")) << answer;
+    answer.clear();
+    ASSERT_TRUE(server.control("GET", "requests?since=x", "", answer, status));
+    EXPECT_EQ(400, status);
+}
+
+TEST_F(LocalServerTest, RefusedPortRefusesConnectionsUntilItIsBack) {
+    std::string answer;
+    long status = 0;
+    ASSERT_TRUE(server.control("POST", "refuse", "{\"scheme\": \"https\", \"on\": true}", answer, status));
+    EXPECT_EQ(200, status) << answer;
+    EXPECT_FALSE(Accepts(server.httpsPort()));
+    EXPECT_EQ(CURLE_COULDNT_CONNECT, Fetch(server.httpsUrl("/test/text"), nullptr, server.caFile()).code);
+    // The other port and its control API serve on.
+    EXPECT_EQ("hello, world\n", Fetch(server.httpUrl("/test/text")).body);
+    ASSERT_TRUE(server.control("POST", "refuse", "{\"scheme\": \"https\", \"on\": false}", answer, status));
+    EXPECT_EQ(200, status) << answer;
+    EXPECT_EQ("hello, world\n", Fetch(server.httpsUrl("/test/text"), nullptr, server.caFile()).body);
+    // A timed refusal ends by itself.
+    ASSERT_TRUE(server.control("POST", "refuse", "{\"scheme\": \"https\", \"on\": true, \"seconds\": 0.3}",
+                               answer, status));
+    EXPECT_FALSE(Accepts(server.httpsPort()));
+    bool back = false;
+    for (int i = 0; i < 100 && !back; ++i) {
+        usleep(50 * 1000);
+        back = Accepts(server.httpsPort());
+    }
+    EXPECT_TRUE(back);
+    answer.clear();
+    ASSERT_TRUE(server.control("GET", "requests", "", answer, status));
+    const Json::Value all = zepatest::ParseJson(answer);
+    ASSERT_EQ(2u, all["refusals"].size()) << answer;
+    EXPECT_EQ("https", all["refusals"][0]["scheme"].asString());
+    EXPECT_LE(all["refusals"][0]["from"].asDouble(), all["refusals"][0]["to"].asDouble());
+    EXPECT_LT(all["refusals"][0]["to"].asDouble(), all["refusals"][1]["from"].asDouble());
+    EXPECT_FALSE(all["refusals"][1]["to"].isNull());
+    ASSERT_TRUE(server.control("POST", "refuse", "{\"scheme\": \"ftp\", \"on\": true}", answer, status));
+    EXPECT_EQ(400, status);
+}
+
+TEST(LocalServerRecords, KeepsAtMostTheNewestRecords) {
+    LocalServer::Options options;
+    options.https = false;
+    options.extraArgs = {"--max-records", "3"};
+    LocalServer server(options);
+    ASSERT_TRUE(server.ok()) << server.error();
+    for (int i = 0; i < 5; ++i) Fetch(server.httpUrl("/test/text?n=" + std::to_string(i)));
+    Json::Value all = server.requests();
+    ASSERT_EQ(3u, all.size());
+    EXPECT_EQ(3, all[0]["seq"].asInt());
+    EXPECT_EQ("n=4", all[2]["query"].asString());
+    std::string answer;
+    long status = 0;
+    ASSERT_TRUE(server.control("GET", "requests", "", answer, status));
+    EXPECT_NE(std::string::npos, answer.find("\"dropped\": 2")) << answer;
 }

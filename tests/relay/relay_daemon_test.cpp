@@ -405,3 +405,89 @@ TEST_F(RelayDaemonTest, ReloadWithNothingChangedKeepsTheTunnelRegistrationAndAli
 }
 
 }  // namespace
+
+namespace {
+
+double SecondsSince(std::chrono::steady_clock::time_point from) {
+    return std::chrono::duration<double>(std::chrono::steady_clock::now() - from).count();
+}
+
+// The link between appliance and relay is cut for 30 s while the tunnel is
+// up, at the relay's end (the appliance keeps its route and loses its
+// carrier, as with a pulled cable), then for 5 s at the appliance's end (its
+// route goes): each time the status leaves READY while the link is cut and
+// is READY again, with the page reachable through the tunnel, once it is
+// back.
+TEST_F(RelayDaemonTest, LinkDownForThirtySecondsShowsAsNotReadyAndComesBack) {
+    ASSERT_EQ(0, StartDaemon());
+    ASSERT_TRUE(StatusHas("tunnel: READY")) << CtlStatus() << Log();
+    ASSERT_TRUE(WaitUntil([&] { return Page().find("200 ") == 0; }, 10000)) << Page();
+    const int firstVpn = StatusFile()["tunnel"]["pid"].asInt();
+    ASSERT_GT(firstVpn, 0);
+
+    // "state error tunnel-status" as the status file says it.
+    auto describe = [](const Json::Value& f) {
+        return std::to_string(f["state"].asInt()) + " " + std::to_string(f["error"].asInt()) + " " +
+               f["tunnel"]["status"].asString();
+    };
+    auto ready = [](const Json::Value& f) {
+        return f["state"].asInt() == 6 && f["tunnel"]["status"].asString() == "READY" &&
+               !f["tunnel"]["peer_ip"].asString().empty();
+    };
+
+    for (const bool atRelay : {true, false}) {
+        const int seconds = atRelay ? 30 : 5;
+        const std::string cut =
+            std::string(atRelay ? "relay" : "appliance") + " end down " + std::to_string(seconds) + " s";
+        const int vpnBefore = StatusFile()["tunnel"]["pid"].asInt();
+        ASSERT_TRUE(relay.Link(false, atRelay));
+        const auto down = std::chrono::steady_clock::now();
+        double leftReadyAfter = -1;
+        bool readyAgainWhileDown = false;
+        std::string seen;  // each change of the status while the link is cut
+        std::string last;
+        while (SecondsSince(down) < seconds) {
+            const Json::Value f = StatusFile();
+            if (f.isMember("state")) {
+                const std::string now = describe(f);
+                if (now != last)
+                    seen += "\n  " + std::to_string(SecondsSince(down)).substr(0, 5) + " s: " + now;
+                last = now;
+                if (!ready(f) && leftReadyAfter < 0) {
+                    leftReadyAfter = SecondsSince(down);
+                    EXPECT_NE(6, f["state"].asInt()) << now;
+                    EXPECT_EQ(6, f["error"].asInt()) << "err_network: " << now;
+                }
+                if (ready(f) && leftReadyAfter >= 0) readyAgainWhileDown = true;
+            }
+            std::this_thread::sleep_for(std::chrono::milliseconds(100));
+        }
+        ASSERT_TRUE(relay.Link(true, atRelay));
+        const auto up = std::chrono::steady_clock::now();
+        std::cout << cut << "; the status while it was cut:" << seen << "\n";
+        EXPECT_GE(leftReadyAfter, 0) << cut << ": still READY all along" << Log();
+        EXPECT_FALSE(readyAgainWhileDown) << cut << seen;
+
+        double readyAfter = -1;
+        double pageAfter = -1;
+        while (SecondsSince(up) < 150 && pageAfter < 0) {
+            if (readyAfter < 0 && ready(StatusFile())) readyAfter = SecondsSince(up);
+            if (readyAfter >= 0 && Page().find("200 ") == 0) pageAfter = SecondsSince(up);
+            std::this_thread::sleep_for(std::chrono::milliseconds(100));
+        }
+        const int vpnAfter = StatusFile()["tunnel"]["pid"].asInt();
+        std::cout << cut << ": not READY " << leftReadyAfter << " s after the cut; READY again " << readyAfter
+                  << " s and the page " << pageAfter << " s after the return; openvpn "
+                  << (vpnAfter == vpnBefore ? "rode the outage out (same pid)"
+                                            : "was replaced (pid " + std::to_string(vpnBefore) + " -> " +
+                                                  std::to_string(vpnAfter) + ")")
+                  << "\n";
+        ASSERT_GE(readyAfter, 0) << cut << CtlStatus() << Log();
+        ASSERT_GE(pageAfter, 0) << cut << Page();
+        EXPECT_EQ(1, VpnClients());
+    }
+    EXPECT_NE(std::string::npos, Log().find("lost its link: no way to the relay")) << Log();
+    EXPECT_NE(std::string::npos, Log().find("is back")) << Log();
+}
+
+}  // namespace

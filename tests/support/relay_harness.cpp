@@ -180,6 +180,13 @@ bool RelayHarness::Silence(bool on) {
     return Admin("POST", "/relay/admin/silence", body)["ok"].asBool();
 }
 
+bool RelayHarness::Link(bool up, bool atRelay) {
+    Json::Value body;
+    body["up"] = up;
+    body["side"] = atRelay ? "relay" : "appliance";
+    return Admin("POST", "/relay/admin/link", body)["ok"].asBool();
+}
+
 bool RelayHarness::Vpn(const std::string& action) {
     Json::Value body;
     body["action"] = action;

@@ -41,6 +41,10 @@ public:
     bool BlockUdp(bool on);
     // The VPN servers' answers dropped: a relay that stays silent.
     bool Silence(bool on);
+    // The link between appliance and relay cut (false) or restored, at the
+    // relay's end (the appliance keeps its route, loses its carrier) or at the
+    // appliance's (it loses its route).
+    bool Link(bool up, bool atRelay = true);
     // "stop" or "start" the VPN servers.
     bool Vpn(const std::string& action);
     Json::Value Admin(const std::string& method, const std::string& path,

@@ -1,6 +1,6 @@
-// The tunnel cycle without a relay: what each registration answer makes of
-// the state, its back-off policy against a clock the test moves by hand, and
-// an incomplete tunnel answer.
+// The tunnel cycle without a relay: the outcome of each registration answer,
+// its back-off policy against a clock the test moves by hand, and an
+// incomplete tunnel answer.
 #include <gtest/gtest.h>
 #include <signal.h>
 #include <stdlib.h>
@@ -25,6 +25,7 @@
 using namespace ZEPA::Relay;
 using zeparelayd::EventLoop;
 using zeparelayd::TunnelCycle;
+using zeparelayd::TunnelOutcome;
 using zeparelayd::TunnelPolicy;
 
 namespace {
@@ -73,9 +74,6 @@ TEST_F(TunnelPolicyTest, AClosedTunnelRegistersAgainWithinFiveMinutes) {
     policy.OnUp();
     jitter = 45678;
     EXPECT_EQ(45678, policy.OnClosed());
-    EXPECT_EQ(45678, policy.RemainingMs());
-    clock.Advance(45000);
-    EXPECT_EQ(678, policy.RemainingMs());
     // Whatever the source gives, the wait stays within the five minutes.
     for (long r : {-1L, -300001L, 7L, 299999L, 600002L, 2147483647L, -2147483647L - 1}) {
         policy.OnUp();
@@ -103,20 +101,17 @@ TEST_F(TunnelPolicyTest, AStartThatFailsAfterACloseGoesOnDoublingFromTheClose) {
     EXPECT_EQ(2000 + 250000 % 501, policy.OnFailure());
 }
 
-TEST_F(TunnelPolicyTest, DeadlineFollowsTheClockAndUpStartsAfresh) {
-    EXPECT_EQ(-1, policy.RemainingMs());
-    policy.OnFailure();
-    EXPECT_EQ(2000, policy.RemainingMs());
+TEST_F(TunnelPolicyTest, UpStartsAfreshAndTheWaitIgnoresTheClock) {
+    EXPECT_EQ(2000, policy.OnFailure());
     clock.Advance(1500);
-    EXPECT_EQ(500, policy.RemainingMs());
-    clock.Advance(1000);
-    EXPECT_EQ(0, policy.RemainingMs());
-    policy.OnFailure();
-    EXPECT_EQ(4000, policy.RemainingMs());
+    EXPECT_EQ(4000, policy.OnFailure());
     policy.OnUp();
     EXPECT_EQ(0, policy.Failures());
-    EXPECT_EQ(-1, policy.RemainingMs());
     EXPECT_EQ(2000, policy.OnFailure());
+    policy.Reset();
+    Json::Value dump;
+    policy.Dump(dump);
+    EXPECT_EQ(0, dump["failures"].asInt());
 }
 
 // A cycle on a real event loop (real time: the timers are short), below a
@@ -124,12 +119,16 @@ TEST_F(TunnelPolicyTest, DeadlineFollowsTheClockAndUpStartsAfresh) {
 class TunnelCycleTest : public ::testing::Test {
 protected:
     TunnelCycleTest()
-        : cycle(loop, monotonic,
-                TunnelCycle::Hooks{[this](RELAYD_STATE s, RELAYD_RET e) {
-                                       states.push_back({s, e});
-                                   },
-                                   [this] { ++reregistrations; }},
-                [this] { return jitter; }) {}
+        : cycle(
+              loop, monotonic,
+              [this](const TunnelOutcome& o) {
+                  if (o.kind == TunnelOutcome::REGISTER_AGAIN) {
+                      ++reregistrations;
+                  } else {
+                      outcomes.push_back(o);
+                  }
+              },
+              [this] { return jitter; }) {}
 
     void SetUp() override {
         char dir[] = "/tmp/zepa_tunnel_cycle_XXXXXX";
@@ -155,7 +154,7 @@ protected:
     long jitter = 0;  // what the cycle's jitter source gives
     zeparelayd::MonotonicClock monotonic;
     EventLoop loop{monotonic};
-    std::vector<std::pair<RELAYD_STATE, RELAYD_RET>> states;
+    std::vector<TunnelOutcome> outcomes;
     int reregistrations = 0;
     TunnelCycle cycle;
     std::string root;
@@ -166,8 +165,9 @@ TEST_F(TunnelCycleTest, DirectAnswerIsStateFourWithoutTunnel) {
     answer["errno"] = 0;
     answer["connect"] = "direct";
     cycle.OnRegistered(answer);
-    ASSERT_EQ(1u, states.size());
-    EXPECT_EQ(RELAYD_STATE_DIRECT_CONNECT, states[0].first);
+    ASSERT_EQ(1u, outcomes.size());
+    EXPECT_EQ(TunnelOutcome::DIRECT, outcomes[0].kind);
+    EXPECT_EQ(RELAYD_SUCCESS, outcomes[0].error);
     EXPECT_EQ("direct", cycle.Status()["connect"].asString());
     EXPECT_FALSE(cycle.Status().isMember("tunnel"));
 }
@@ -176,8 +176,8 @@ TEST_F(TunnelCycleTest, AnswerWithoutConnectWordIsRegisteredOnly) {
     Json::Value answer;
     answer["errno"] = 0;
     cycle.OnRegistered(answer);
-    ASSERT_EQ(1u, states.size());
-    EXPECT_EQ(RELAYD_STATE_CONNECTED, states[0].first);
+    ASSERT_EQ(1u, outcomes.size());
+    EXPECT_EQ(TunnelOutcome::REGISTERED, outcomes[0].kind);
     EXPECT_EQ(-1, loop.TimerRemaining("heartbeat"));
 }
 
@@ -186,15 +186,15 @@ TEST_F(TunnelCycleTest, ArrayAnswerAndWrongTypesAreReadSafely) {
     answer[0u]["connect"] = "direct";
     answer[0u]["heartbeat"] = "soon";
     cycle.OnRegistered(answer);
-    ASSERT_EQ(1u, states.size());
-    EXPECT_EQ(RELAYD_STATE_DIRECT_CONNECT, states[0].first);
+    ASSERT_EQ(1u, outcomes.size());
+    EXPECT_EQ(TunnelOutcome::DIRECT, outcomes[0].kind);
     EXPECT_EQ(-1, loop.TimerRemaining("heartbeat"));
 
     Json::Value odd;
     odd["connect"] = 7;
     cycle.OnRegistered(odd);
-    ASSERT_EQ(2u, states.size());
-    EXPECT_EQ(RELAYD_STATE_CONNECTED, states[1].first);
+    ASSERT_EQ(2u, outcomes.size());
+    EXPECT_EQ(TunnelOutcome::REGISTERED, outcomes[1].kind);
     EXPECT_EQ("", cycle.Status()["connect"].asString());
 }
 
@@ -216,10 +216,11 @@ TEST_F(TunnelCycleTest, IncompleteTunnelAnswerIsAnErrorWithBackOff) {
     answer["tunnel"]["relay_pass"] = "";
     cycle.OnRegistered(answer);
     RunFor(50);
-    ASSERT_EQ(2u, states.size());
-    EXPECT_EQ(RELAYD_STATE_CONNECTED, states[0].first);
-    EXPECT_EQ(RELAYD_STATE_LOGIN, states[1].first);
-    EXPECT_EQ(RELAYD_ERR_NOT_SUPPORT, states[1].second);
+    ASSERT_EQ(2u, outcomes.size());
+    EXPECT_EQ(TunnelOutcome::REGISTERED, outcomes[0].kind);
+    EXPECT_EQ(TunnelOutcome::FAILED, outcomes[1].kind);
+    EXPECT_EQ(RELAYD_ERR_NOT_SUPPORT, outcomes[1].error);
+    EXPECT_EQ(2000, outcomes[1].retryMs);
     const Json::Value status = cycle.Status();
     EXPECT_EQ("INVALID_CONF", status["tunnel"]["status"].asString());
     EXPECT_EQ(1, status["tunnel"]["failures"].asInt());
@@ -231,7 +232,13 @@ TEST_F(TunnelCycleTest, IncompleteTunnelAnswerIsAnErrorWithBackOff) {
     Json::Value dump;
     cycle.Dump(dump);
     EXPECT_EQ(1, dump["retry"]["failures"].asInt());
+    // The time left is the loop's timer's.
+    EXPECT_LE(dump["retry"]["retry_in_ms"].asInt64(), 2000);
+    EXPECT_GE(dump["retry"]["retry_in_ms"].asInt64(), loop.TimerRemaining("tunnel_retry"));
     EXPECT_FALSE(dump["tunnel"].isMember("relay_pass"));
+    loop.CancelTimer("tunnel_retry");
+    cycle.Dump(dump);
+    EXPECT_EQ(-1, dump["retry"]["retry_in_ms"].asInt64());
 }
 
 TEST_F(TunnelCycleTest, PasswordIsNeverShown) {
@@ -323,9 +330,9 @@ protected:
         return held;
     }
 
-    bool SawState(RELAYD_STATE state) const {
-        for (const auto& s : states) {
-            if (s.first == state) return true;
+    bool Saw(TunnelOutcome::Kind kind) const {
+        for (const auto& o : outcomes) {
+            if (o.kind == kind) return true;
         }
         return false;
     }
@@ -336,7 +343,7 @@ TEST_F(TunnelStartTest, PeerAddressFromTheUpScriptMakesItReadyAndThePassFileGoes
     Write("/etc/openvpn.mode", "up");
     AskForTunnel();
     ASSERT_TRUE(RunUntil([&] { return cycle.IsUp(); }, 5000));
-    EXPECT_EQ(RELAYD_STATE_CONNECTED_ALT, states.back().first);
+    EXPECT_EQ(TunnelOutcome::UP, outcomes.back().kind);
     const Json::Value status = cycle.Status();
     EXPECT_EQ("READY", status["tunnel"]["status"].asString());
     EXPECT_EQ("10.214.0.1", status["tunnel"]["peer_ip"].asString());
@@ -349,14 +356,14 @@ TEST_F(TunnelStartTest, PeerAddressFromTheUpScriptMakesItReadyAndThePassFileGoes
     // The down script takes the peer address away while openvpn reconnects:
     // no longer READY, until the up script reports again.
     ASSERT_EQ(0, unlink((root + "/tmp/.zepa_farlink_tunnel_info").c_str()));
-    ASSERT_TRUE(RunUntil([&] { return states.back().first == RELAYD_STATE_CONNECTED; }, 3000));
-    EXPECT_EQ(RELAYD_ERR_NETWORK, states.back().second);
+    ASSERT_TRUE(RunUntil([&] { return outcomes.back().kind == TunnelOutcome::LINK_LOST; }, 3000));
+    EXPECT_EQ(RELAYD_ERR_NETWORK, outcomes.back().error);
     EXPECT_FALSE(cycle.IsUp());
     EXPECT_EQ("NONE", cycle.Status()["tunnel"]["status"].asString());
     Write("/tmp/.zepa_farlink_tunnel_info", "peer_ip=\"10.214.0.1\"\n");
     cycle.OnUpSignal();
     EXPECT_TRUE(cycle.IsUp());
-    EXPECT_EQ(RELAYD_STATE_CONNECTED_ALT, states.back().first);
+    EXPECT_EQ(TunnelOutcome::UP, outcomes.back().kind);
 
     cycle.Stop(true);
     EXPECT_NE(0, kill(pid, 0));
@@ -373,8 +380,8 @@ TEST_F(TunnelStartTest, ATunnelThatWasUpAndClosedRegistersAgainAfterTheSpreadWai
     const int pid = TunnelPid();
     ASSERT_GT(pid, 0);
     ASSERT_EQ(0, kill(pid, SIGTERM));
-    ASSERT_TRUE(RunUntil([&] { return SawState(RELAYD_STATE_LOGIN); }, 3000));
-    EXPECT_EQ(RELAYD_ERR_NETWORK, states.back().second);
+    ASSERT_TRUE(RunUntil([&] { return Saw(TunnelOutcome::FAILED); }, 3000));
+    EXPECT_EQ(RELAYD_ERR_NETWORK, outcomes.back().error);
     EXPECT_EQ("CLOSE", cycle.Status()["tunnel"]["status"].asString());
     EXPECT_EQ(1, cycle.Status()["tunnel"]["failures"].asInt());
     EXPECT_FALSE(Exists("/tmp/.zepa_farlink_tunnel_info"));
@@ -391,14 +398,14 @@ TEST_F(TunnelStartTest, ASecondFailedStartWaitsTwiceAsLong) {
     Write("/etc/openvpn.mode", "die");
     jitter = 700;  // 2 s plus 700 % 501 ms; then 4 s plus 700 % 1001 ms
     AskForTunnel();
-    ASSERT_TRUE(RunUntil([&] { return SawState(RELAYD_STATE_LOGIN); }, 5000));
+    ASSERT_TRUE(RunUntil([&] { return Saw(TunnelOutcome::FAILED); }, 5000));
     EXPECT_EQ("FAILED", cycle.Status()["tunnel"]["status"].asString());
     int64_t retry = loop.TimerRemaining("tunnel_retry");
     EXPECT_GT(retry, 1000);  // not the close's 700 ms
     EXPECT_LE(retry, 2199);
-    states.clear();
+    outcomes.clear();
     AskForTunnel();
-    ASSERT_TRUE(RunUntil([&] { return SawState(RELAYD_STATE_LOGIN); }, 5000));
+    ASSERT_TRUE(RunUntil([&] { return Saw(TunnelOutcome::FAILED); }, 5000));
     EXPECT_EQ(2, cycle.Status()["tunnel"]["failures"].asInt());
     retry = loop.TimerRemaining("tunnel_retry");
     EXPECT_GT(retry, 2700);
@@ -413,9 +420,9 @@ TEST_F(TunnelStartTest, SilentChildIsNeverReadyAndIsEndedAfterTheWait) {
     // An up signal without a peer address changes nothing.
     cycle.OnUpSignal();
     EXPECT_FALSE(cycle.IsUp());
-    ASSERT_TRUE(RunUntil([&] { return SawState(RELAYD_STATE_LOGIN); }, 5000));
-    EXPECT_FALSE(SawState(RELAYD_STATE_CONNECTED_ALT));
-    EXPECT_EQ(RELAYD_ERR_NETWORK, states.back().second);
+    ASSERT_TRUE(RunUntil([&] { return Saw(TunnelOutcome::FAILED); }, 5000));
+    EXPECT_FALSE(Saw(TunnelOutcome::UP));
+    EXPECT_EQ(RELAYD_ERR_NETWORK, outcomes.back().error);
     // UDP first, then TCP, each ended when the wait ran out.
     EXPECT_EQ("udp\ntcp-client\n", Read("/var/log/openvpn.calls"));
     EXPECT_EQ("FAILED", cycle.Status()["tunnel"]["status"].asString());
@@ -428,9 +435,9 @@ TEST_F(TunnelStartTest, SilentChildIsNeverReadyAndIsEndedAfterTheWait) {
 TEST_F(TunnelStartTest, ChildThatDiesFallsBackToTcpThenFails) {
     Write("/etc/openvpn.mode", "die");
     AskForTunnel();
-    ASSERT_TRUE(RunUntil([&] { return SawState(RELAYD_STATE_LOGIN); }, 5000));
+    ASSERT_TRUE(RunUntil([&] { return Saw(TunnelOutcome::FAILED); }, 5000));
     EXPECT_EQ("udp\ntcp-client\n", Read("/var/log/openvpn.calls"));
-    EXPECT_FALSE(SawState(RELAYD_STATE_CONNECTED_ALT));
+    EXPECT_FALSE(Saw(TunnelOutcome::UP));
     EXPECT_FALSE(Exists("/tmp/.tunnel.zr1"));
 }
 

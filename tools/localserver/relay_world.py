@@ -27,7 +27,11 @@ Facts of Debian's openvpn 2.6 this set-up follows:
   * the servers push their own tun MTU, so they use the client's 1400;
   * a UDP server sends an exit notice to its clients when stopped
     ("--explicit-exit-notify"), which ends a client at once instead of
-    after its 10-second "--ping-exit".
+    after its 10-second "--ping-exit";
+  * "--keepalive 10 60" pushes "ping 10" and "ping-restart 60", which take
+    the place of the client's own "--ping-exit 10": a client rides out a
+    link lost for 30 s (with "ping-restart 30" it would leave at about the
+    moment the link came back).
 """
 
 import ctypes
@@ -217,7 +221,7 @@ class RelayWorld:
                    "--client-connect", os.path.join(self.work, "connect.sh"),
                    "--client-disconnect", os.path.join(self.work, "disconnect.sh"),
                    "--comp-lzo", "adaptive", "--allow-compression", "asym",
-                   "--keepalive", "3", "30", "--verb", "3", "--log", log]
+                   "--keepalive", "10", "60", "--verb", "3", "--log", log]
             if proto == "udp":
                 # Both ways: a stopped server tells its clients, a stopped
                 # client tells the server (its proxy entry goes at once).
@@ -323,6 +327,18 @@ class RelayWorld:
             elif not on and self.udp_blocked:
                 _run("ip", "-n", self.appliance_ns, "rule", "del", "pref", "10")
             self.udp_blocked = on
+
+    def link(self, up, side="relay"):
+        """The link between appliance and relay cut (nothing passes either
+        way) or restored, at one end of the veth pair: "relay" sets "relay0"
+        down, so the appliance's "wan0" keeps its route and loses its carrier
+        (as with a pulled cable); "appliance" sets "wan0" down, which takes
+        its route away."""
+        if side not in ("relay", "appliance"):
+            raise RelayWorldError("bad side %r (relay or appliance)" % side)
+        ns, dev = (self.relay_ns, "relay0") if side == "relay" else (self.appliance_ns, "wan0")
+        with self.lock:
+            _run("ip", "-n", ns, "link", "set", dev, "up" if up else "down")
 
     def silence(self, on):
         """Drops every answer of the relay's VPN servers (UDP and TCP, from

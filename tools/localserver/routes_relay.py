@@ -50,6 +50,9 @@ Admin calls for tests and demos:
                                                    address, no tunnel (for comparisons)
   POST /relay/admin/block_udp {"on": bool}         UDP to the VPN port dropped
   POST /relay/admin/silence {"on": bool}           the VPN servers' answers dropped (silent relay)
+  POST /relay/admin/link {"up": bool, "side"}      the link cut or restored at the "relay" end
+                                                   (default; the appliance loses its carrier) or
+                                                   the "appliance" end (it loses its route)
   POST /relay/admin/refuse {"on": bool}            the VPN servers refuse every password
   POST /relay/admin/vpn {"action": "stop" | "start"}   the VPN servers
   GET  /relay/admin/tunnels                        -> {"tunnels": {user: address}, "aliases": {...}}
@@ -284,6 +287,16 @@ def register(server):
         server.relay.silence(bool(req.json().get("on")))
         return core.json_reply({"ok": True})
 
+    def link(req):
+        if server.relay is None:
+            return needs_relay()
+        body = req.json()
+        side = body.get("side", "relay")
+        if side not in ("relay", "appliance"):
+            return core.json_reply({"ok": False, "error": "side: relay or appliance"}, 400)
+        server.relay.link(bool(body.get("up")), side)
+        return core.json_reply({"ok": True})
+
     def refuse(req):
         if server.relay is None:
             return needs_relay()
@@ -317,6 +330,7 @@ def register(server):
     server.route("/relay/admin/block_udp", block_udp, methods=["POST"])
     server.route("/relay/admin/vpn", vpn, methods=["POST"])
     server.route("/relay/admin/refuse", refuse, methods=["POST"])
+    server.route("/relay/admin/link", link, methods=["POST"])
     server.route("/relay/admin/silence", silence, methods=["POST"])
     server.route("/relay/admin/tunnels", tunnels, methods=["GET"])
     server.route(PAGE, serv, methods=["POST"])

@@ -31,20 +31,32 @@ Control API (never recorded):
        (default 0); "stream" answers `size` bytes: the body given, repeated,
        written piece by piece so that a gigabyte costs the server nothing
        (it stops when the client hangs up).
-  GET  /_control/requests[?path=/x]    -> {"requests": [record, ...]} in arrival order
+  GET  /_control/requests[?path=/x][&since=SEQ]
+                                       -> {"requests": [record, ...], "dropped": D, "refusals": [...]}
+                                          in arrival order (records after SEQ only, when given)
   POST /_control/reset                 -> forgets records and scripts, runs reset hooks
+  POST /_control/refuse {"scheme": "https" | "http", "on": bool, "seconds": S}
+       stops listening on that port while keeping it bound, so that every
+       connection is refused (as by a server that is down), until called
+       with "on": false or, when given, for S seconds; answers the time it
+       took effect. The other port (and its control API) keeps serving.
 
 A record: {"seq", "scheme", "method", "target" (the raw request target),
 "path", "query", "has_query", "request_line_base64" (the request line's
 exact bytes), "version", "headers": [[name, value], ...] in wire order
 (latin-1),
-"body_base64", "body_latin1", "body_length", "client_port"}.
+"body_base64", "body_latin1", "body_length", "client_port", "time" (arrival,
+Unix seconds), and once answered "answer_time", "answer_status" (the HTTP
+status, or the action: "hang", "close", "reset") and "answer_latin1" (the
+first 512 bytes of the answer's body)}. At most --max-records are kept (the
+oldest go first; "dropped" counts them).
 
 SIGTERM and SIGINT stop the server cleanly (exit status 0).
 """
 
 import argparse
 import base64
+import collections
 import glob
 import importlib.util
 import json
@@ -65,6 +77,13 @@ from http.server import BaseHTTPRequestHandler, ThreadingHTTPServer
 sys.dont_write_bytecode = True
 
 CONTROL_PREFIX = "/_control/"
+# Records kept for the control API: a fleet of daemons runs for hours, the
+# server must not grow without bound.
+DEFAULT_MAX_RECORDS = 50000
+# Pending connections the kernel holds for each listener: a fleet that
+# connects at the same moment must not see dropped handshakes.
+LISTEN_BACKLOG = 1024
+ANSWER_EXCERPT = 512
 
 
 class Req:
@@ -81,6 +100,7 @@ class Req:
         self.headers = [[k, v] for k, v in handler.headers.items()]
         self.body = body
         self.scheme = scheme
+        self.time = time.time()
         self.client_port = handler.client_address[1]
         # The request line as received, for byte-exact checks of the target.
         self.request_line = handler.raw_requestline.rstrip(b"\r\n")
@@ -119,6 +139,7 @@ class Req:
             "body_latin1": self.body.decode("latin-1"),
             "body_length": len(self.body),
             "client_port": self.client_port,
+            "time": self.time,
         }
 
 
@@ -176,7 +197,13 @@ class LocalServer:
         self.lock = threading.Lock()
         self.routes = {}
         self.scripts = {}
-        self.records = []
+        self.records = collections.deque()
+        self.max_records = DEFAULT_MAX_RECORDS
+        self.dropped = 0
+        self.next_seq = 1
+        # When a listener refused connections: [{"scheme", "from", "to"}].
+        self.refusals = []
+        self.listeners = {}
         self.state = {}
         self.reset_hooks = []
         self.stopping = threading.Event()
@@ -206,16 +233,61 @@ class LocalServer:
         """Sleeps up to seconds; returns early (True) when the server stops."""
         return self.stopping.wait(seconds)
 
-    def requests(self, path=None):
+    def requests(self, path=None, since=0):
         with self.lock:
-            return [r for r in self.records if path is None or r["path"] == path]
+            return [dict(r) for r in self.records
+                    if (path is None or r["path"] == path) and r["seq"] > since]
 
     # ---- dispatch -----------------------------------------------------------
     def record(self, req):
         with self.lock:
             rec = req.record()
-            rec["seq"] = len(self.records) + 1
+            rec["seq"] = self.next_seq
+            self.next_seq += 1
             self.records.append(rec)
+            while len(self.records) > self.max_records:
+                self.records.popleft()
+                self.dropped += 1
+            return rec
+
+    def answered(self, rec, reply):
+        """Notes on the record what the request got."""
+        if rec is None:
+            return
+        with self.lock:
+            rec["answer_time"] = time.time()
+            rec["answer_status"] = reply.status if reply.action in ("reply", "stream") else reply.action
+            body = reply.body if isinstance(reply.body, bytes) else b""
+            rec["answer_latin1"] = body[:ANSWER_EXCERPT].decode("latin-1")
+
+    def refuse(self, scheme, on, seconds=0.0):
+        """Stops (or resumes) accepting on the listener of scheme; the time it took effect."""
+        listener = self.listeners.get(scheme)
+        if listener is None:
+            return None
+        with listener.refuse_lock:
+            if on and not listener.refusing:
+                listener.stop_listening()
+                with self.lock:
+                    self.refusals.append({"scheme": scheme, "from": time.time(), "to": None})
+            elif not on and listener.refusing:
+                with self.lock:
+                    for r in self.refusals:
+                        if r["scheme"] == scheme and r["to"] is None:
+                            r["to"] = time.time()
+                listener.resume_listening()
+            listener.refuse_generation += 1
+            generation = listener.refuse_generation
+            took_effect = time.time()
+        if on and seconds > 0:
+            def back():
+                if not self.wait(seconds):
+                    with listener.refuse_lock:
+                        if listener.refuse_generation != generation:
+                            return
+                    self.refuse(scheme, False)
+            threading.Thread(target=back, daemon=True).start()
+        return took_effect
 
     def take_script(self, path):
         with self.lock:
@@ -232,6 +304,9 @@ class LocalServer:
         if req.path.startswith(CONTROL_PREFIX):
             return self.control(req)
         self.record(req)
+        return self.route_reply(req)
+
+    def route_reply(self, req):
         scripted = self.take_script(req.path)
         if scripted is not None:
             return scripted
@@ -260,11 +335,30 @@ class LocalServer:
                 self.scripts.setdefault(plan["path"], []).append(plan)
             return json_reply({"ok": True})
         if name == "requests":
-            path = req.params().get("path")
-            return json_reply({"requests": self.requests(path)})
+            params = req.params()
+            try:
+                since = int(params.get("since", "0"))
+            except ValueError:
+                return json_reply({"ok": False, "error": "since is a record number"}, 400)
+            records = self.requests(params.get("path"), since)
+            with self.lock:
+                return json_reply({"requests": records, "dropped": self.dropped,
+                                   "refusals": [dict(r) for r in self.refusals]})
+        if name == "refuse" and req.method == "POST":
+            try:
+                plan = req.json()
+                seconds = float(plan.get("seconds", 0))
+            except (ValueError, TypeError, AttributeError):
+                return json_reply({"ok": False, "error": "body is {\"scheme\", \"on\", \"seconds\"}"}, 400)
+            took_effect = self.refuse(plan.get("scheme"), bool(plan.get("on")), seconds)
+            if took_effect is None:
+                return json_reply({"ok": False, "error": "no listener for that scheme"}, 400)
+            return json_reply({"ok": True, "time": took_effect})
         if name == "reset" and req.method == "POST":
             with self.lock:
-                self.records = []
+                self.records.clear()
+                self.dropped = 0
+                self.refusals = []
                 self.scripts = {}
             for hook in self.reset_hooks:
                 hook()
@@ -307,10 +401,16 @@ class Handler(BaseHTTPRequestHandler):
     def _handle(self):
         app = self.server.app
         req = Req(self, self.scheme, self._read_body())
+        rec = None
         try:
-            reply = app.dispatch(req)
+            if req.path.startswith(CONTROL_PREFIX):
+                reply = app.control(req)
+            else:
+                rec = app.record(req)
+                reply = app.route_reply(req)
         except Exception as exc:  # a broken route answers 500, the server lives on
             reply = text_reply("route failed: %r\n" % (exc,), 500)
+        app.answered(rec, reply)
         self._send(reply)
 
     def _send(self, reply):
@@ -380,11 +480,50 @@ class HttpsHandler(Handler):
 class Listener(ThreadingHTTPServer):
     daemon_threads = True
     allow_reuse_address = True
+    request_queue_size = LISTEN_BACKLOG
 
     def __init__(self, app, handler, ssl_context=None):
         super().__init__(("127.0.0.1", 0), handler)
         self.app = app
         self.ssl_context = ssl_context
+        self.refuse_lock = threading.Lock()
+        self.refusing = False
+        self.refuse_generation = 0
+        self.thread = None
+
+    def server_bind(self):
+        # The port is bound by its number, not as "any port": a listener that
+        # stops listening (refuse) keeps such a port, and gets it back.
+        self.socket.setsockopt(socket.SOL_SOCKET, socket.SO_REUSEADDR, 1)
+        for _ in range(20):
+            probe = socket.socket(socket.AF_INET, socket.SOCK_STREAM)
+            probe.bind(("127.0.0.1", 0))
+            port = probe.getsockname()[1]
+            probe.close()
+            try:
+                self.socket.bind(("127.0.0.1", port))
+                break
+            except OSError:
+                continue
+        else:
+            self.socket.bind(self.server_address)
+        self.server_address = self.socket.getsockname()
+
+    def start(self):
+        self.thread = threading.Thread(target=self.serve_forever, kwargs={"poll_interval": 0.1}, daemon=True)
+        self.thread.start()
+
+    def stop_listening(self):
+        """The accept loop ends and the socket stops listening (port kept):
+        connections are refused. Those the kernel had queued are reset."""
+        self.shutdown()
+        self.socket.shutdown(socket.SHUT_RD)
+        self.refusing = True
+
+    def resume_listening(self):
+        self.socket.listen(self.request_queue_size)
+        self.refusing = False
+        self.start()
 
     def get_request(self):
         sock, addr = super().get_request()
@@ -490,7 +629,11 @@ def main(argv=None):
                         "gone, so that a test killed midway leaves no server, openvpn or namespace behind")
     parser.add_argument("--clock-offset", type=float, default=0.0, metavar="SECONDS",
                         help="shift the time of every Date header by SECONDS (a server with a wrong clock)")
+    parser.add_argument("--max-records", type=int, default=DEFAULT_MAX_RECORDS, metavar="N",
+                        help="request records kept for the control API; the oldest go first (default %(default)s)")
     args = parser.parse_args(argv)
+    if args.max_records < 1:
+        parser.error("--max-records wants at least 1")
 
     # A stop request may come at any moment, even while the certificates are
     # made: it ends the server quietly, never with a traceback.
@@ -507,6 +650,7 @@ def main(argv=None):
     app = LocalServer()
     app.verbose = args.verbose
     app.clock_offset = args.clock_offset
+    app.max_records = args.max_records
     relay_temp = None
     if args.relay:
         import relay_world
@@ -540,11 +684,11 @@ def main(argv=None):
         app.ca_file = ca_crt
         app.https_port = listeners[1].server_address[1]
     app.http_port = listeners[0].server_address[1]
-
-    threads = [threading.Thread(target=l.serve_forever, kwargs={"poll_interval": 0.1}, daemon=True)
-               for l in listeners]
-    for t in threads:
-        t.start()
+    app.listeners = {"http": listeners[0]}
+    if len(listeners) > 1:
+        app.listeners["https"] = listeners[1]
+    for l in listeners:
+        l.start()
 
     ready = {"http_port": app.http_port, "https_port": app.https_port, "ca_file": app.ca_file,
              "pid": os.getpid()}
@@ -556,8 +700,10 @@ def main(argv=None):
 
     app.stopping.set()
     for l in listeners:
-        l.shutdown()
-        l.server_close()
+        with l.refuse_lock:
+            if not l.refusing:
+                l.shutdown()
+            l.server_close()
     if app.relay is not None:
         app.relay.close()
     if relay_temp is not None:

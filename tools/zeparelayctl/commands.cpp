@@ -18,10 +18,11 @@
 #include <zeparelayd/errors.h>
 
 #include "config_check.h"
-#include "daemon_process.h"
 #include "doctor.h"
+#include "relayd_protocol.h"
 
 using namespace ZEPA::Relay;
+namespace key = zepatools::status_key;
 
 namespace zeparelayctl {
 
@@ -40,10 +41,10 @@ void SayNotRunning(const PidFileState& daemon, FILE* out) {
 }
 
 // A signal for the daemon, only when the PID file names a live zeparelayd.
-int SignalDaemon(int sig, PidFileState& daemon) {
+int SignalDaemon(DaemonSignal request, PidFileState& daemon) {
     daemon = DaemonFromPidFile();
     if (daemon.pid <= 0) return EXIT_NOT_RUNNING;
-    return kill(daemon.pid, sig) == 0 ? EXIT_OK : EXIT_NOT_RUNNING;
+    return kill(daemon.pid, SignalOf(request)) == 0 ? EXIT_OK : EXIT_NOT_RUNNING;
 }
 
 // The configuration as the daemon would read it; a broken one is named with
@@ -61,7 +62,7 @@ bool ConfigUsable(const std::string& path) {
 // Asks a running daemon to re-read its configuration; says what happened.
 int Reload(const char* what) {
     PidFileState daemon;
-    if (SignalDaemon(SIGHUP, daemon) == EXIT_OK) {
+    if (SignalDaemon(DaemonSignal::RELOAD, daemon) == EXIT_OK) {
         printf("%s; the daemon reloads its configuration\n", what);
         return EXIT_OK;
     }
@@ -92,12 +93,12 @@ StatusView ReadStatus() {
         view.result = EXIT_BROKEN_STATUS;
         return view;
     }
-    if (file.isObject() && file["serverID"].isString()) view.serverId = file["serverID"].asString();
+    if (file.isObject() && file[key::kServerId].isString()) view.serverId = file[key::kServerId].asString();
     int state = 1;
     int error = 0;
     if (probe == RELAYD_RESULT_OK) {
-        if (file["state"].isInt()) state = file["state"].asInt();
-        if (file["error"].isInt()) error = file["error"].asInt();
+        if (file[key::kState].isInt()) state = file[key::kState].asInt();
+        if (file[key::kError].isInt()) error = file[key::kError].asInt();
     }
     view.state = GetStateStr(static_cast<RELAYD_STATE>(state));
     view.error = GetErrorStr(static_cast<RELAYD_RET>(error));
@@ -110,8 +111,8 @@ StatusView ReadStatus() {
         AliasConf alias;
         if (conf.isMember("server_alias")) alias.Overwrite(conf["server_alias"]);
         view.aliasName = alias.GetAliasName();
-    } else if (file.isObject() && file["alias"].isString()) {
-        view.aliasName = file["alias"].asString();
+    } else if (file.isObject() && file[key::kAlias].isString()) {
+        view.aliasName = file[key::kAlias].asString();
     }
     AliasStatus aliasStatus;
     std::string extra;
@@ -121,14 +122,15 @@ StatusView ReadStatus() {
 
 // How the relay reaches the appliance: the daemon's own part of the file.
 void PrintConnection(const Json::Value& file) {
-    const Json::Value& connect = file["connect"];
+    const Json::Value& connect = file[key::kConnect];
     if (connect.isString() && !connect.asString().empty()) printf("connect: %s\n", connect.asCString());
-    const Json::Value& tunnel = file["tunnel"];
+    const Json::Value& tunnel = file[key::kTunnel];
     if (tunnel.isObject()) {
-        printf("tunnel: %s, relay %s, peer %s, pid %d\n", tunnel.get("status", "").asString().c_str(),
-               tunnel.get("relay_ip", "").asString().c_str(),
-               tunnel.get("peer_ip", "").asString().empty() ? "--" : tunnel["peer_ip"].asCString(),
-               tunnel.get("pid", -1).isInt() ? tunnel.get("pid", -1).asInt() : -1);
+        const std::string peer = tunnel.get(key::kTunnelPeerIp, "").asString();
+        printf("tunnel: %s, relay %s, peer %s, pid %d\n",
+               tunnel.get(key::kTunnelStatus, "").asString().c_str(),
+               tunnel.get(key::kTunnelRelayIp, "").asString().c_str(), peer.empty() ? "--" : peer.c_str(),
+               tunnel.get(key::kTunnelPid, -1).isInt() ? tunnel.get(key::kTunnelPid, -1).asInt() : -1);
     }
 }
 
@@ -142,8 +144,8 @@ int StatusText() {
     printf("serverID: %s\nstate: %s\nalias: %s\nalias_status: %s\n", view.serverId.c_str(),
            view.state.c_str(), view.aliasName.c_str(), view.aliasStatus.c_str());
     if (view.error != "success") printf("error: %s\n", view.error.c_str());
-    if (view.file["config_error"].isString())
-        printf("config_error: %s\n", view.file["config_error"].asCString());
+    if (view.file[key::kConfigError].isString())
+        printf("config_error: %s\n", view.file[key::kConfigError].asCString());
     PrintConnection(view.file);
     return view.result;
 }
@@ -167,12 +169,12 @@ int StatusJson() {
     out["services"] = Json::Value(Json::arrayValue);
     out["pid"] = Json::Value();
     if (view.file.isObject()) {
-        for (const Json::Value& s : view.file["service"]) {
-            if (s.isObject() && s["id"].isString()) out["services"].append(s["id"]);
+        for (const Json::Value& s : view.file[key::kService]) {
+            if (s.isObject() && s[key::kServiceId].isString()) out["services"].append(s[key::kServiceId]);
         }
-        out["pid"] = view.file["pid"];
-        for (const char* key : {"connect", "tunnel", "config_error"}) {
-            if (view.file.isMember(key)) out[key] = view.file[key];
+        out["pid"] = view.file[key::kPid];
+        for (const char* copied : {key::kConnect, key::kTunnel, key::kConfigError}) {
+            if (view.file.isMember(copied)) out[copied] = view.file[copied];
         }
     }
     Json::StreamWriterBuilder writer;
@@ -240,9 +242,9 @@ int ServerId(const Args& args, const Options&) {
 }
 
 // A signal that asks the running daemon for one thing; says it was sent.
-int Ask(int sig, const char* done) {
+int Ask(DaemonSignal request, const char* done) {
     PidFileState daemon;
-    if (SignalDaemon(sig, daemon) != EXIT_OK) {
+    if (SignalDaemon(request, daemon) != EXIT_OK) {
         SayNotRunning(daemon, stderr);
         return EXIT_NOT_RUNNING;
     }
@@ -251,7 +253,7 @@ int Ask(int sig, const char* done) {
 }
 
 int UpdateAlias(const Args& args, const Options&) {
-    return args.empty() ? Ask(SIGRTMIN + 1, "alias update requested") : EXIT_USAGE;
+    return args.empty() ? Ask(DaemonSignal::UPDATE_ALIAS, "alias update requested") : EXIT_USAGE;
 }
 
 int ReloadCmd(const Args& args, const Options&) {
@@ -266,7 +268,7 @@ int ReloadCmd(const Args& args, const Options&) {
 }
 
 int ReopenLog(const Args& args, const Options&) {
-    return args.empty() ? Ask(SIGRTMIN + 2, "the daemon reopens its log file") : EXIT_USAGE;
+    return args.empty() ? Ask(DaemonSignal::REOPEN_LOG, "the daemon reopens its log file") : EXIT_USAGE;
 }
 
 int CheckConfig(const Args& args, const Options&) {
@@ -287,7 +289,7 @@ bool WaitGone(pid_t pid, int seconds) {
 int Stop(const Args& args, const Options&) {
     if (!args.empty()) return EXIT_USAGE;
     PidFileState daemon;
-    if (SignalDaemon(SIGTERM, daemon) != EXIT_OK) {
+    if (SignalDaemon(DaemonSignal::STOP, daemon) != EXIT_OK) {
         // Stopping what does not run is done already.
         SayNotRunning(daemon, stdout);
         return EXIT_OK;

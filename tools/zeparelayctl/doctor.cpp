@@ -25,11 +25,12 @@
 #include <zeparelayd/tunnel.h>
 
 #include "config_check.h"
-#include "daemon_process.h"
 #include "probes.h"
+#include "relayd_protocol.h"
 
 using namespace ZEPA::Relay;
 using namespace zepatools;
+namespace key = zepatools::status_key;
 
 namespace zeparelayctl {
 
@@ -304,7 +305,7 @@ private:
             return;
         }
         _status = status;
-        const int statusPid = status["pid"].isInt() ? status["pid"].asInt() : -1;
+        const int statusPid = status[key::kPid].isInt() ? status[key::kPid].asInt() : -1;
         struct stat st {};
         std::string written;
         if (stat(Daemon::GetStatusPath().c_str(), &st) == 0)
@@ -321,22 +322,22 @@ private:
         }
 
         t = NowMs();
-        const int state = status["state"].isInt() ? status["state"].asInt() : 1;
-        const int error = status["error"].isInt() ? status["error"].asInt() : 0;
+        const int state = status[key::kState].isInt() ? status[key::kState].asInt() : 1;
+        const int error = status[key::kError].isInt() ? status[key::kError].asInt() : 0;
         const std::string stateWord = GetStateStr(static_cast<RELAYD_STATE>(state));
         const std::string errorWord = GetErrorStr(static_cast<RELAYD_RET>(error));
         std::string detail = "state " + stateWord;
         if (error != 0) detail += ", error " + errorWord;
-        const std::string since = Ago(status["registration_at"]);
+        const std::string since = Ago(status[key::kRegistrationAt]);
         if (!since.empty()) detail += ", since " + since;
-        const std::string retry = Until(status["registration_retry_at"]);
+        const std::string retry = Until(status[key::kRegistrationRetryAt]);
         if (!retry.empty()) detail += "; next attempt " + retry;
-        if (status["config_error"].isString())
-            detail += "; last reload refused: " + Printable(status["config_error"].asString());
+        if (status[key::kConfigError].isString())
+            detail += "; last reload refused: " + Printable(status[key::kConfigError].asString());
         if (state == RELAYD_STATE_DIRECT_CONNECT || state == RELAYD_STATE_CONNECTED ||
             state == RELAYD_STATE_CONNECTED_ALT) {
-            if (!status["serverID"].asString().empty())
-                detail += ", server id " + Printable(status["serverID"].asString(), 64);
+            if (!status[key::kServerId].asString().empty())
+                detail += ", server id " + Printable(status[key::kServerId].asString(), 64);
             Add("daemon.registration", Verdict::OK, "registered: " + detail, "", t);
         } else if (state == RELAYD_STATE_STARTING) {
             Add("daemon.registration", Verdict::WARN, detail,
@@ -353,17 +354,19 @@ private:
         }
 
         t = NowMs();
-        const std::string alias = status["alias"].isString() ? status["alias"].asString() : std::string();
-        const std::string word = status["alias_status"].isString() ? status["alias_status"].asString() : "";
+        const std::string alias =
+            status[key::kAlias].isString() ? status[key::kAlias].asString() : std::string();
+        const std::string word =
+            status[key::kAliasStatus].isString() ? status[key::kAliasStatus].asString() : "";
         if (alias.empty()) {
             Add("daemon.alias", Verdict::SKIPPED, "no alias configured", "", t);
             return;
         }
         std::string aliasDetail =
             "alias " + Printable(alias, 64) + ": " + (word.empty() ? "no result yet" : Printable(word, 64));
-        const std::string aliasSince = Ago(status["alias_at"]);
+        const std::string aliasSince = Ago(status[key::kAliasAt]);
         if (!word.empty() && !aliasSince.empty()) aliasDetail += ", since " + aliasSince;
-        const std::string aliasNext = Until(status["alias_retry_at"]);
+        const std::string aliasNext = Until(status[key::kAliasRetryAt]);
         if (!aliasNext.empty()) aliasDetail += "; next exchange " + aliasNext;
         if (word == "good") {
             Add("daemon.alias", Verdict::OK, aliasDetail, "", t);
@@ -692,9 +695,9 @@ private:
         }
 
         const Json::Value& status = _status;  // const: a null stays null
-        const Json::Value& tunnel = status["tunnel"];
-        const std::string relay = tunnel.isObject() && tunnel["relay_ip"].isString()
-                                      ? tunnel["relay_ip"].asString()
+        const Json::Value& tunnel = status[key::kTunnel];
+        const std::string relay = tunnel.isObject() && tunnel[key::kTunnelRelayIp].isString()
+                                      ? tunnel[key::kTunnelRelayIp].asString()
                                       : std::string();
         if (relay.empty()) {
             const char* why2 = _status.isObject()

@@ -36,9 +36,13 @@ std::string OutcomeWord(bool answered, ALIAS_RET ret, const Request& req) {
 
 }  // namespace
 
-AliasCycle::AliasCycle(RelaydConf& conf, EventLoop& loop, const Clock& clock, Hooks hooks,
+AliasCycle::AliasCycle(RelaydConf& conf, EventLoop& loop, const Clock& clock, OutcomeHandler onOutcome,
                        RandomSource random)
-    : _conf(conf), _loop(loop), _policy(clock, std::move(random)), _hooks(std::move(hooks)) {}
+    : _conf(conf),
+      _loop(loop),
+      _policy(clock, std::move(random)),
+      _onOutcome(std::move(onOutcome)),
+      _registered(false) {}
 
 void AliasCycle::Follow(const AliasStep& step, const char* why) {
     _loop.CancelTimer(TAG);
@@ -66,7 +70,6 @@ void AliasCycle::OnRequested() {
 void AliasCycle::Stop() {
     _loop.CancelTimer(TAG);
     _loop.CancelRequests(TAG);
-    _policy.OnAttempt();
     _next.clear();
 }
 
@@ -77,8 +80,7 @@ void AliasCycle::Reset() {
 
 void AliasCycle::Run(ALIAS_REQUEST_CMD cmd) {
     _next.clear();
-    _policy.OnAttempt();
-    if (_hooks.registered && !_hooks.registered()) {
+    if (!_registered) {
         RLOG(LOG_INFO, "alias %s skipped: not registered", CommandWord(cmd));
         return;
     }
@@ -94,6 +96,7 @@ void AliasCycle::Run(ALIAS_REQUEST_CMD cmd) {
     if (!builder.SetRequest(cmd, data) || !builder.GetRequest(body, url)) {
         _policy.OnIncompleteData();
         Record("error_bad_param", "incomplete alias data");
+        Deliver(cmd, ALIAS_RET_BAD_PARAM);
         return;
     }
     boost::shared_ptr<Request> req(new Request(url.c_str(), body.c_str(), true));
@@ -101,6 +104,7 @@ void AliasCycle::Run(ALIAS_REQUEST_CMD cmd) {
     if (!_loop.StartRequest(TAG, req, [this, cmd](boost::shared_ptr<Request> r) { OnDone(cmd, r); })) {
         Record("error_unknown", "request not started");
         Follow(_policy.OnNotStarted(cmd, _conf.alias.GetPollSeconds()), "not started");
+        Deliver(cmd, ALIAS_RET_UNKNOWN);
     }
 }
 
@@ -112,6 +116,7 @@ void AliasCycle::OnDone(ALIAS_REQUEST_CMD cmd, boost::shared_ptr<Request> req) {
     const int polling = ret == ALIAS_RET_SUCCESS ? _conf.alias.GetPollingTime() : 0;
     Follow(_policy.OnOutcome(cmd, ret, _conf.alias.GetPollSeconds(), polling),
            ret == ALIAS_RET_SUCCESS ? "success" : "failure");
+    Deliver(cmd, ret);
 }
 
 bool AliasCycle::Pending() const { return _loop.TimerRemaining(TAG) >= 0 || _loop.HasRequest(TAG); }
@@ -130,6 +135,7 @@ void AliasCycle::DeleteOnDisable() {
         std::string detail;
         AliasRequest::GetResponseForDaemon(r, ret, detail);
         Record(ret == ALIAS_RET_SUCCESS ? "deleted" : "error_delete", detail);
+        Deliver(ALIAS_REQ_DELETE, ret);
     });
 }
 
@@ -138,7 +144,19 @@ void AliasCycle::Record(const std::string& word, const std::string& extra) {
     _extra = extra;
     AliasStatus status;
     status.SetStatus(_conf.alias.GetAliasName(), word, extra, true);
-    if (_hooks.changed) _hooks.changed();
+}
+
+// Once the next step is planned, so that the outcome tells it.
+void AliasCycle::Deliver(ALIAS_REQUEST_CMD cmd, ALIAS_RET ret) {
+    if (!_onOutcome) return;
+    AliasOutcome outcome;
+    outcome.cmd = cmd;
+    outcome.ret = ret;
+    outcome.word = _word;
+    outcome.extra = _extra;
+    outcome.halted = _policy.Halted();
+    outcome.nextMs = _loop.TimerRemaining(TAG);
+    _onOutcome(outcome);
 }
 
 void AliasCycle::Dump(Json::Value& out) const {
@@ -147,6 +165,7 @@ void AliasCycle::Dump(Json::Value& out) const {
     out["extra"] = _extra;
     out["next"] = _next;
     _policy.Dump(out);
+    out["next_in_ms"] = static_cast<Json::Int64>(_loop.TimerRemaining(TAG));
 }
 
 }  // namespace zeparelayd

@@ -12,6 +12,8 @@
 #include <cstdio>
 #include <cstring>
 
+#include "relayd_protocol.h"
+
 namespace zeparelayd {
 
 namespace {
@@ -101,7 +103,7 @@ bool InstallDebugDump(const std::string& path) {
     sa.sa_handler = OnDumpSignal;
     sigemptyset(&sa.sa_mask);
     sa.sa_flags = SA_RESTART;
-    return sigaction(SIGUSR1, &sa, nullptr) == 0;
+    return sigaction(zepatools::SignalOf(zepatools::DaemonSignal::DEBUG_DUMP), &sa, nullptr) == 0;
 }
 
 void PublishDebugDump(const std::string& text) {
@@ -110,7 +112,7 @@ void PublishDebugDump(const std::string& text) {
 }
 
 void RemoveDebugDump() {
-    signal(SIGUSR1, SIG_IGN);
+    signal(zepatools::SignalOf(zepatools::DaemonSignal::DEBUG_DUMP), SIG_IGN);
     delete gText.exchange(nullptr);
 }
 

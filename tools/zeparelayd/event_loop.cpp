@@ -125,38 +125,53 @@ int EventLoop::PollTimeout() const {
 bool EventLoop::Run() {
     _running = true;
     while (_running) {
-        if (_onIdle) _onIdle();
-        std::vector<pollfd> fds;
-        fds.push_back(pollfd{daemon_signal_fd(), POLLIN, 0});
-        for (const auto& s : _sockets) {
-            short events = 0;
-            if (s.second & CURL_POLL_IN) events |= POLLIN;
-            if (s.second & CURL_POLL_OUT) events |= POLLOUT;
-            fds.push_back(pollfd{s.first, events, 0});
-        }
-        const size_t sockets = fds.size();
-        if (_clockFd >= 0) fds.push_back(pollfd{_clockFd, POLLIN, 0});
-        int n = poll(fds.data(), fds.size(), PollTimeout());
-        if (n < 0 && errno != EINTR) {
-            RLOG(LOG_ERR, "poll failed (%d)", errno);
-            return false;
-        }
-        if (n > 0 && (fds[0].revents & POLLIN)) DrainSignals();
-        if (n > 0 && sockets < fds.size() && fds[sockets].revents != 0) DrainClock();
-        for (size_t i = 1; n > 0 && _running && i < sockets; ++i) {
-            if (fds[i].revents == 0) continue;
-            int mask = 0;
-            if (fds[i].revents & POLLIN) mask |= CURL_CSELECT_IN;
-            if (fds[i].revents & POLLOUT) mask |= CURL_CSELECT_OUT;
-            if (fds[i].revents & (POLLERR | POLLHUP | POLLNVAL)) mask |= CURL_CSELECT_ERR;
-            SocketAction(fds[i].fd, mask);
-        }
-        if (_running && _curlDueMs >= 0 && _curlDueMs <= _clock.NowMs()) {
-            _curlDueMs = -1;
-            SocketAction(CURL_SOCKET_TIMEOUT, 0);
-        }
-        if (_running) RunDueTimers();
+        if (!Round(-1)) return false;
     }
+    return true;
+}
+
+bool EventLoop::RunOnce(int maxWaitMs) {
+    _running = true;
+    const bool ok = Round(std::max(maxWaitMs, 0));
+    _running = false;
+    return ok;
+}
+
+// maxWaitMs < 0: as long as the timers and curl allow.
+bool EventLoop::Round(int maxWaitMs) {
+    if (_onIdle) _onIdle();
+    std::vector<pollfd> fds;
+    fds.push_back(pollfd{daemon_signal_fd(), POLLIN, 0});
+    for (const auto& s : _sockets) {
+        short events = 0;
+        if (s.second & CURL_POLL_IN) events |= POLLIN;
+        if (s.second & CURL_POLL_OUT) events |= POLLOUT;
+        fds.push_back(pollfd{s.first, events, 0});
+    }
+    const size_t sockets = fds.size();
+    if (_clockFd >= 0) fds.push_back(pollfd{_clockFd, POLLIN, 0});
+    int timeout = PollTimeout();
+    if (maxWaitMs >= 0 && (timeout < 0 || timeout > maxWaitMs)) timeout = maxWaitMs;
+    int n = poll(fds.data(), fds.size(), timeout);
+    if (n < 0 && errno != EINTR) {
+        RLOG(LOG_ERR, "poll failed (%d)", errno);
+        return false;
+    }
+    if (n > 0 && (fds[0].revents & POLLIN)) DrainSignals();
+    if (n > 0 && sockets < fds.size() && fds[sockets].revents != 0) DrainClock();
+    for (size_t i = 1; n > 0 && _running && i < sockets; ++i) {
+        if (fds[i].revents == 0) continue;
+        int mask = 0;
+        if (fds[i].revents & POLLIN) mask |= CURL_CSELECT_IN;
+        if (fds[i].revents & POLLOUT) mask |= CURL_CSELECT_OUT;
+        if (fds[i].revents & (POLLERR | POLLHUP | POLLNVAL)) mask |= CURL_CSELECT_ERR;
+        SocketAction(fds[i].fd, mask);
+    }
+    if (_running && _curlDueMs >= 0 && _curlDueMs <= _clock.NowMs()) {
+        _curlDueMs = -1;
+        SocketAction(CURL_SOCKET_TIMEOUT, 0);
+    }
+    if (_running) RunDueTimers();
     return true;
 }
 

@@ -63,6 +63,9 @@ public:
 
     // Runs until Stop(); false when the loop could not wait.
     bool Run();
+    // One round of events, waiting at most maxWaitMs for the first (tests
+    // that move a clock by hand step the loop with it); false as Run().
+    bool RunOnce(int maxWaitMs);
     void Stop() { _running = false; }
     bool Running() const { return _running; }
 
@@ -76,6 +79,7 @@ private:
     static int TimerCallback(CURLM* multi, long timeoutMs, void* userp);
 
     int PollTimeout() const;
+    bool Round(int maxWaitMs);
     void DrainSignals();
     void WatchClock();
     void DrainClock();

@@ -24,13 +24,13 @@
 
 #include "clock.h"
 #include "config_check.h"
-#include "daemon_process.h"
 #include "event_loop.h"
 #include "exit_codes.h"
 #include "log.h"
 #include "log_file_check.h"
 #include "recovery.h"
 #include "relay_daemon.h"
+#include "relayd_protocol.h"
 
 using namespace ZEPA::Relay;
 using namespace zepatools;
@@ -182,14 +182,9 @@ int ApplyEarlyLogSettings(const std::string& confPath, bool foreground) {
 // (inherited across the fork) exist by then too; they are let through once
 // the loop can answer them. EXIT_OK, or the exit status.
 int HoldSignals(sigset_t& previous) {
-    sigset_t held;
-    sigemptyset(&held);
-    for (int sig : {SIGINT, SIGTERM, SIGQUIT, SIGPIPE, SIGHUP, SIGCHLD, SIGALRM, SIGUSR1, SIGUSR2,
-                    SIGRTMIN + 1, SIGRTMIN + 5, zeparelayd::ReopenLogSignal()}) {
-        sigaddset(&held, sig);
-    }
+    const sigset_t held = DaemonSignalSet();
     sigprocmask(SIG_BLOCK, &held, &previous);
-    if (Daemon::InitSignalHandler() < 0 || daemon_signal_install(zeparelayd::ReopenLogSignal()) < 0) {
+    if (Daemon::InitSignalHandler() < 0 || daemon_signal_install(SignalOf(DaemonSignal::REOPEN_LOG)) < 0) {
         fprintf(stderr, "zeparelayd: cannot install the signal handlers\n");
         return EXIT_NO_LOOP;
     }

@@ -16,8 +16,8 @@
 #include <zeparelayd/daemon.h>
 #include <zeparelayd/tunnel.h>
 
-#include "daemon_process.h"
 #include "log.h"
+#include "relayd_protocol.h"
 
 using ZEPA::Relay::Daemon;
 using ZEPA::Relay::Tunnel;
@@ -129,9 +129,7 @@ bool IsOpenvpn(pid_t pid) {
 
 // The daemon of this root that the PID file names, if it runs: it keeps its
 // tunnel and its dumps.
-bool IsRunningDaemon(pid_t pid) {
-    return pid > 0 && pid != getpid() && zepatools::DaemonFromPidFile().pid == pid;
-}
+bool IsRunningDaemon(pid_t pid) { return pid != getpid() && zepatools::IsRunningDaemon(pid); }
 
 void SleepMs(int ms) {
     struct timespec ts = {ms / 1000, (ms % 1000) * 1000000L};

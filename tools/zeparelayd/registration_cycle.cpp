@@ -17,12 +17,12 @@ const char TAG[] = "register";
 
 }  // namespace
 
-RegistrationCycle::RegistrationCycle(RelaydConf& conf, EventLoop& loop, const Clock& clock, Hooks hooks,
-                                     RandomSource random)
+RegistrationCycle::RegistrationCycle(RelaydConf& conf, EventLoop& loop, const Clock& clock,
+                                     OutcomeHandler onOutcome, RandomSource random)
     : _conf(conf),
       _loop(loop),
       _policy(clock, std::move(random)),
-      _hooks(std::move(hooks)),
+      _onOutcome(std::move(onOutcome)),
       _error(RELAYD_SUCCESS) {}
 
 Json::Value RegistrationCycle::Body() {
@@ -36,15 +36,13 @@ Json::Value RegistrationCycle::Body() {
     return body;
 }
 
-void RegistrationCycle::SetState(RELAYD_STATE state, RELAYD_RET error) {
-    _error = error;
-    if (_hooks.setState) _hooks.setState(state, error);
+void RegistrationCycle::Deliver(RegistrationOutcome outcome) {
+    if (_onOutcome) _onOutcome(outcome);
 }
 
 void RegistrationCycle::Stop() {
     _loop.CancelTimer(TAG);
     _loop.CancelRequests(TAG);
-    _policy.OnAttempt();
 }
 
 void RegistrationCycle::Restart() {
@@ -53,28 +51,43 @@ void RegistrationCycle::Restart() {
     Start();
 }
 
-void RegistrationCycle::Start(bool keepState) {
+void RegistrationCycle::Start(bool heartbeat) {
     Stop();
     if (!_conf.enable) {
         RLOG(LOG_NOTICE, "relay is disabled, idle until reload");
-        if (_hooks.disabled) _hooks.disabled();
-        SetState(RELAYD_STATE_LOGOUT, RELAYD_SUCCESS);
+        _error = RELAYD_SUCCESS;
+        RegistrationOutcome off;
+        off.kind = RegistrationOutcome::OFF;
+        Deliver(off);
         return;
     }
+    _policy.OnAttempt();
     const std::string url = _conf.serverControl.GetUrl(nullptr);
     boost::shared_ptr<Request> req(new Request(url, Body(), true));
-    if (!keepState) SetState(RELAYD_STATE_LOGIN, _error);
+    // Out before the request starts: a refused connection finishes at once.
+    RegistrationOutcome sending;
+    sending.kind = RegistrationOutcome::SENDING;
+    sending.error = _error;
+    sending.heartbeat = heartbeat;
+    Deliver(sending);
     if (url.empty() || !_loop.StartRequest(TAG, req, [this](boost::shared_ptr<Request> r) { OnDone(r); })) {
         RLOG(LOG_ERR, "cannot send registration to [%s]", url.c_str());
-        _policy.OnFailure(RELAYD_ERR_CONFIG);
-        SetState(RELAYD_STATE_LOGIN, RELAYD_ERR_CONFIG);
+        Failed(RELAYD_ERR_CONFIG, _policy.OnFailure(RELAYD_ERR_CONFIG));
     }
 }
 
-void RegistrationCycle::RetryIn(int64_t delayMs) {
-    RLOG(LOG_INFO, "registration retry in %lld ms (failures %d, moves %d)", static_cast<long long>(delayMs),
-         _policy.Failures(), _policy.Moves());
-    _loop.SetTimer(TAG, delayMs, [this] { Start(); });
+void RegistrationCycle::Failed(RELAYD_RET error, int64_t retryMs) {
+    _error = error;
+    if (retryMs != RegistrationPolicy::WAIT_FOR_RELOAD) {
+        RLOG(LOG_INFO, "registration retry in %lld ms (failures %d, moves %d)",
+             static_cast<long long>(retryMs), _policy.Failures(), _policy.Moves());
+        _loop.SetTimer(TAG, retryMs, [this] { Start(); });
+    }
+    RegistrationOutcome failed;
+    failed.kind = RegistrationOutcome::FAILED;
+    failed.error = error;
+    failed.retryMs = retryMs;
+    Deliver(failed);
 }
 
 void RegistrationCycle::OnDone(boost::shared_ptr<Request> req) {
@@ -92,26 +105,30 @@ void RegistrationCycle::OnDone(boost::shared_ptr<Request> req) {
     if (err == RELAYD_ERR_SERVER_CHANGED && AnswerString(answer, "control_host", host)) {
         RLOG(LOG_NOTICE, "control server moved to [%s]", host.c_str());
         _conf.WriteControlServerHost("", host);
-        _error = err;
         const int64_t delay = _policy.OnServerMoved();
-        if (delay == 0) {
-            Start();
-        } else {
-            SetState(RELAYD_STATE_LOGIN, err);
-            RetryIn(delay);
+        if (delay != 0) {
+            Failed(err, delay);
+            return;
         }
+        // The first move is followed at once.
+        _error = err;
+        RegistrationOutcome moved;
+        moved.kind = RegistrationOutcome::FAILED;
+        moved.error = err;
+        moved.retryMs = 0;
+        Deliver(moved);
+        Start();
         return;
     }
     if (err != RELAYD_SUCCESS) {
         const int64_t delay = _policy.OnFailure(err);
-        SetState(RELAYD_STATE_LOGIN, err);
         if (delay == RegistrationPolicy::WAIT_FOR_RELOAD) {
             RLOG(LOG_WARNING, "registration failed (%s): waiting for a reload", GetErrorStr(err).c_str());
-            return;
+        } else if (err == RELAYD_ERR_RESOLV) {
+            // A stale resolver answer is the likely cause of a resolve failure.
+            Request::CleanDnsCache();
         }
-        // A stale resolver answer is the likely cause of a resolve failure.
-        if (err == RELAYD_ERR_RESOLV) Request::CleanDnsCache();
-        RetryIn(delay);
+        Failed(err, delay);
         return;
     }
     _policy.OnSuccess();
@@ -119,11 +136,10 @@ void RegistrationCycle::OnDone(boost::shared_ptr<Request> req) {
     if (AnswerString(answer, "serverID", id)) StoreServerId(id);
     RLOG(LOG_NOTICE, "registered, server id [%s]", _conf.serverID.c_str());
     _error = RELAYD_SUCCESS;
-    if (_hooks.registered) {
-        _hooks.registered(answer);
-    } else {
-        SetState(RELAYD_STATE_CONNECTED, RELAYD_SUCCESS);
-    }
+    RegistrationOutcome registered;
+    registered.kind = RegistrationOutcome::REGISTERED;
+    registered.answer = answer;
+    Deliver(registered);
 }
 
 void RegistrationCycle::StoreServerId(const std::string& id) {
@@ -135,6 +151,9 @@ void RegistrationCycle::StoreServerId(const std::string& id) {
     _conf.WriteServerId("");
 }
 
-void RegistrationCycle::Dump(Json::Value& out) const { _policy.Dump(out); }
+void RegistrationCycle::Dump(Json::Value& out) const {
+    _policy.Dump(out);
+    out["retry_in_ms"] = static_cast<Json::Int64>(_loop.TimerRemaining(TAG));
+}
 
 }  // namespace zeparelayd

@@ -4,13 +4,17 @@
 //    "services": [{"id", "name", "port", "ext_port"}, ...]}
 // answered by {"errno": <RELAYSERVER_ERR>, "serverID": "<id>"}; with errno 13
 // (server changed) the answer may name the new "control_host". Retries follow
-// RegistrationPolicy.
+// RegistrationPolicy, each wait one loop timer.
+//
+// The cycle does not decide the daemon's state: every step ends in a
+// RegistrationOutcome handed to the daemon, which makes the state of it.
 #ifndef ZEPARELAYD_TOOL_REGISTRATION_CYCLE_H
 #define ZEPARELAYD_TOOL_REGISTRATION_CYCLE_H
 
 #include <json/value.h>
 
 #include <boost/shared_ptr.hpp>
+#include <cstdint>
 #include <functional>
 #include <string>
 
@@ -23,45 +27,59 @@
 
 namespace zeparelayd {
 
+// What a step of the registration gave.
+struct RegistrationOutcome {
+    enum Kind {
+        // The relay is switched off: nothing is sent until a reload.
+        OFF,
+        // An attempt is on its way; error is the last attempt's.
+        SENDING,
+        // The attempt failed with error (RELAYD_ERR_SERVER_CHANGED: the
+        // control server named a new host); the next attempt is due in
+        // retryMs, or never before a reload (RegistrationPolicy::WAIT_FOR_RELOAD).
+        FAILED,
+        // Registered: answer says how the appliance is reached ("connect",
+        // "tunnel", "heartbeat").
+        REGISTERED,
+    };
+    Kind kind = SENDING;
+    ZEPA::Relay::RELAYD_RET error = ZEPA::Relay::RELAYD_SUCCESS;
+    // SENDING: a heartbeat asked for while registered.
+    bool heartbeat = false;
+    int64_t retryMs = RegistrationPolicy::WAIT_FOR_RELOAD;
+    Json::Value answer;
+};
+
 class RegistrationCycle {
 public:
-    struct Hooks {
-        // The daemon's state changed: write it out.
-        std::function<void(ZEPA::Relay::RELAYD_STATE, ZEPA::Relay::RELAYD_RET)> setState;
-        // Registered: the answer says how the appliance is reached ("connect",
-        // "tunnel", "heartbeat"); the hook sets the state (4, 5 or 6) and the
-        // alias may follow. Without a hook the state is 5.
-        std::function<void(const Json::Value& answer)> registered;
-        // The relay is switched off: everything else stops too.
-        std::function<void()> disabled;
-    };
+    using OutcomeHandler = std::function<void(const RegistrationOutcome&)>;
 
-    RegistrationCycle(ZEPA::Relay::RelaydConf& conf, EventLoop& loop, const Clock& clock, Hooks hooks,
-                      RandomSource random = SystemRandom());
+    RegistrationCycle(ZEPA::Relay::RelaydConf& conf, EventLoop& loop, const Clock& clock,
+                      OutcomeHandler onOutcome, RandomSource random = SystemRandom());
 
-    // Registers now (or idles when the relay is switched off). keepState: a
-    // heartbeat while registered, the state stays as it is meanwhile.
-    void Start(bool keepState = false);
+    // Registers now (or reports OFF when the relay is switched off).
+    // heartbeat: asked for while registered (the outcome says so).
+    void Start(bool heartbeat = false);
     // Drops the running exchange and the retry timer.
     void Stop();
     // After a reload: counts and halts start afresh, then Start().
     void Restart();
-    ZEPA::Relay::RELAYD_RET LastError() const { return _error; }
-    // This cycle's part of the debug dump.
+    // This cycle's part of the debug dump: the policy's counts and
+    // "retry_in_ms", the retry timer's time left (-1: none).
     void Dump(Json::Value& out) const;
 
 private:
     Json::Value Body();
     void OnDone(boost::shared_ptr<ZEPA::Relay::Request> req);
     void StoreServerId(const std::string& id);
-    void RetryIn(int64_t delayMs);
-    void SetState(ZEPA::Relay::RELAYD_STATE state, ZEPA::Relay::RELAYD_RET error);
+    void Failed(ZEPA::Relay::RELAYD_RET error, int64_t retryMs);
+    void Deliver(RegistrationOutcome outcome);
 
     ZEPA::Relay::RelaydConf& _conf;
     EventLoop& _loop;
     RegistrationPolicy _policy;
-    Hooks _hooks;
-    ZEPA::Relay::RELAYD_RET _error;
+    OutcomeHandler _onOutcome;
+    ZEPA::Relay::RELAYD_RET _error;  // of the last finished attempt
 };
 
 }  // namespace zeparelayd

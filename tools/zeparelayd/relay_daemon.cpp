@@ -13,6 +13,7 @@
 #include "config_check.h"
 #include "debug_dump.h"
 #include "log.h"
+#include "relayd_protocol.h"
 #include "systemd_notify.h"
 
 using namespace ZEPA::Relay;
@@ -26,32 +27,68 @@ RelayDaemon::RelayDaemon(const std::string& confPath, EventLoop& loop, const Clo
       _conf(new RelaydConf(confPath.c_str())),
       _state(RELAYD_STATE_STARTING),
       _error(RELAYD_SUCCESS),
-      _registration(*_conf, loop, clock,
-                    RegistrationCycle::Hooks{[this](RELAYD_STATE s, RELAYD_RET e) { SetState(s, e); },
-                                             [this](const Json::Value& answer) { OnRegistered(answer); },
-                                             [this] {
-                                                 _alias.Stop();
-                                                 _tunnel.Stop(false);
-                                             }},
-                    random),
-      _alias(*_conf, loop, clock, AliasCycle::Hooks{[this] { return IsRegistered(); }, nullptr}, random),
-      _tunnel(loop, clock,
-              TunnelCycle::Hooks{[this](RELAYD_STATE s, RELAYD_RET e) { SetState(s, e); },
-                                 [this] { _registration.Start(IsRegistered()); }},
-              random) {}
+      _registration(
+          *_conf, loop, clock, [this](const RegistrationOutcome& o) { OnRegistration(o); }, random),
+      _alias(
+          *_conf, loop, clock, [this](const AliasOutcome& o) { OnAlias(o); }, random),
+      _tunnel(
+          loop, clock, [this](const TunnelOutcome& o) { OnTunnel(o); }, random) {}
 
 bool RelayDaemon::IsRegistered() const {
     return _state == RELAYD_STATE_DIRECT_CONNECT || _state == RELAYD_STATE_CONNECTED ||
            _state == RELAYD_STATE_CONNECTED_ALT;
 }
 
-void RelayDaemon::OnRegistered(const Json::Value& answer) {
-    _tunnel.OnRegistered(answer);
-    // A heartbeat leaves a scheduled or running alias exchange alone.
-    if (!_alias.Pending()) _alias.OnRegistered();
+void RelayDaemon::OnRegistration(const RegistrationOutcome& outcome) {
+    switch (outcome.kind) {
+        case RegistrationOutcome::OFF:
+            // The relay is switched off: everything else stops too.
+            _alias.Stop();
+            _tunnel.Stop(false);
+            SetState(RELAYD_STATE_LOGOUT, RELAYD_SUCCESS);
+            break;
+        case RegistrationOutcome::SENDING:
+            // A heartbeat keeps the state as it is meanwhile.
+            if (!outcome.heartbeat) SetState(RELAYD_STATE_LOGIN, outcome.error);
+            break;
+        case RegistrationOutcome::FAILED:
+            SetState(RELAYD_STATE_LOGIN, outcome.error);
+            break;
+        case RegistrationOutcome::REGISTERED:
+            // The tunnel's outcome gives the state (4, 5 or 6).
+            _tunnel.OnRegistered(outcome.answer);
+            // A heartbeat leaves a scheduled or running alias exchange alone.
+            if (!_alias.Pending()) _alias.OnRegistered();
+            break;
+    }
 }
 
-int ReopenLogSignal() { return SIGRTMIN + 2; }
+void RelayDaemon::OnTunnel(const TunnelOutcome& outcome) {
+    switch (outcome.kind) {
+        case TunnelOutcome::DIRECT:
+            SetState(RELAYD_STATE_DIRECT_CONNECT, RELAYD_SUCCESS);
+            break;
+        case TunnelOutcome::REGISTERED:
+            SetState(RELAYD_STATE_CONNECTED, RELAYD_SUCCESS);
+            break;
+        case TunnelOutcome::UP:
+            SetState(RELAYD_STATE_CONNECTED_ALT, RELAYD_SUCCESS);
+            break;
+        case TunnelOutcome::LINK_LOST:
+            // Registered, but nothing gets through until openvpn is back.
+            SetState(RELAYD_STATE_CONNECTED, outcome.error);
+            break;
+        case TunnelOutcome::FAILED:
+            SetState(RELAYD_STATE_LOGIN, outcome.error);
+            break;
+        case TunnelOutcome::REGISTER_AGAIN:
+            // A heartbeat while registered keeps the state.
+            _registration.Start(IsRegistered());
+            break;
+    }
+}
+
+void RelayDaemon::OnAlias(const AliasOutcome& outcome) { _aliasWord = outcome.word; }
 
 // What the registration depends on: the relay switch, the servers, the
 // identity and the services. The log settings and the alias are not part of it.
@@ -91,43 +128,40 @@ bool RelayDaemon::Start() {
          _conf->enable ? "enabled" : "disabled");
     SetState(RELAYD_STATE_STARTING, RELAYD_SUCCESS);
     _registration.Start();
-    NotifyReady(ServiceStatusLine(GetStateStr(_state), GetErrorStr(_error), _alias.Word()));
+    NotifyReady(ServiceStatusLine(GetStateStr(_state), GetErrorStr(_error), _aliasWord));
     return true;
 }
 
 void RelayDaemon::HandleSignal(int sig) {
-    if (sig == SIGRTMIN + 1) {
-        _alias.OnRequested();
-        return;
-    }
-    if (sig == ReopenLogSignal()) {
-        // Same file and level as now: SetLogFile reopens it (appending).
-        RLOG(LOG_INFO, "reopening the log file");
-        Daemon::SetLogFile(Daemon::_strLogFile, Daemon::_logLevel);
-        RLOG(LOG_INFO, "log file reopened");
-        return;
-    }
-    switch (sig) {
-        case SIGTERM:
-        case SIGINT:
-        case SIGQUIT:
+    switch (zepatools::MeaningOf(sig)) {
+        case zepatools::DaemonSignal::UPDATE_ALIAS:
+            _alias.OnRequested();
+            break;
+        case zepatools::DaemonSignal::REOPEN_LOG:
+            // Same file and level as now: SetLogFile reopens it (appending).
+            RLOG(LOG_INFO, "reopening the log file");
+            Daemon::SetLogFile(Daemon::_strLogFile, Daemon::_logLevel);
+            RLOG(LOG_INFO, "log file reopened");
+            break;
+        case zepatools::DaemonSignal::STOP:
             RLOG(LOG_NOTICE, "signal %d: stopping", sig);
             _loop.Stop();
             break;
-        case SIGHUP:
+        case zepatools::DaemonSignal::RELOAD:
             Reload();
             break;
-        case SIGCHLD:
+        case zepatools::DaemonSignal::CHILD_EXITED:
             // The tunnel reaps its own children first: it needs their end.
             _tunnel.OnChildExited();
             ReapChildren();
             break;
-        case SIGUSR2:
+        case zepatools::DaemonSignal::TUNNEL_UP:
             _tunnel.OnUpSignal();
             break;
-        default:
-            // SIGUSR1 comes this way only before the dump handler took it over
+        case zepatools::DaemonSignal::DEBUG_DUMP:
+            // Comes this way only before the dump handler took it over
             // (debug_dump.h); that query then sees no answer and may ask again.
+        case zepatools::DaemonSignal::OTHER:
             // SIGPIPE, SIGALRM, SIGRTMIN+5: their handlers only have to exist;
             // nothing to do here.
             RLOG(LOG_DEBUG, "signal %d ignored", sig);

@@ -1,12 +1,16 @@
 // The relay daemon proper: it holds the configuration, wires the cycles that
-// talk to the relay's servers, owns the state they report and publishes it
-// (status file, debug dump). All of it runs in one EventLoop.
+// talk to the relay's servers, decides the state from the outcomes they
+// report and publishes it (status file, debug dump). All of it runs in one
+// EventLoop, which also holds every timer.
 //
 // The cycles:
 //   - RegistrationCycle: the control server learns our identity and services;
 //   - AliasCycle: the public alias stays registered once we are;
 //   - TunnelCycle: how the appliance is reached after each registration
 //     (directly, or through a VPN tunnel to the relay).
+// No cycle sets the state or calls another: each hands its outcomes to the
+// daemon (OnRegistration, OnAlias, OnTunnel), which sets the state and tells
+// the other cycles what follows.
 #ifndef ZEPARELAYD_TOOL_RELAY_DAEMON_H
 #define ZEPARELAYD_TOOL_RELAY_DAEMON_H
 
@@ -25,10 +29,6 @@
 #include "tunnel_cycle.h"
 
 namespace zeparelayd {
-
-// The signal that makes the daemon reopen its log file (after rotation) and
-// nothing else: SIGRTMIN+2 (SIGUSR2 belongs to the tunnel).
-int ReopenLogSignal();
 
 // "log_level" and "log_file" of a configuration through Daemon::SetLogFile;
 // the file is an appliance path, taken below the system root.
@@ -63,7 +63,8 @@ public:
     // Status file with state "starting", the debug dump handler, then the
     // first registration.
     bool Start();
-    // What each signal asks of the daemon; stop signals end the loop.
+    // What each signal asks of the daemon (relayd_protocol.h); stop signals
+    // end the loop.
     void HandleSignal(int sig);
     // After every round of events: the status file (written when it changed)
     // and what SIGUSR1 will write.
@@ -77,7 +78,9 @@ private:
     void ReapChildren();
     // States 4, 5 and 6: registered, however the appliance is reached.
     bool IsRegistered() const;
-    void OnRegistered(const Json::Value& answer);
+    void OnRegistration(const RegistrationOutcome& outcome);
+    void OnAlias(const AliasOutcome& outcome);
+    void OnTunnel(const TunnelOutcome& outcome);
 
     // ---- published files (status_writer.cpp) ---------------------------------
     void SetState(ZEPA::Relay::RELAYD_STATE state, ZEPA::Relay::RELAYD_RET error);
@@ -91,6 +94,8 @@ private:
     std::unique_ptr<ZEPA::Relay::RelaydConf> _conf;
     ZEPA::Relay::RELAYD_STATE _state;
     ZEPA::Relay::RELAYD_RET _error;
+    // The alias word of the last exchange, as the status shows it.
+    std::string _aliasWord;
     Json::Value _lastStatus;
     // Why the last reload was refused ("FILE:LINE:COLUMN: ..."); empty after a
     // good one. Shown in the status file as "config_error".

@@ -44,11 +44,6 @@ int64_t BackoffRule::WaitMs(int n, int64_t previousMs, const RandomSource& rando
     }
 }
 
-int64_t Deadline::RemainingMs() const {
-    if (_dueMs < 0) return -1;
-    return std::max<int64_t>(_dueMs - _clock.NowMs(), 0);
-}
-
 // ---- registration ------------------------------------------------------------
 
 RandomSource SystemRandom() {
@@ -59,19 +54,15 @@ RegistrationPolicy::RegistrationPolicy(const Clock& clock, RandomSource random, 
     : _clock(clock),
       _random(std::move(random)),
       _rules(rules),
-      _due(clock),
       _attemptMs(-1),
       _failures(0),
       _moves(0),
       _halted(false),
       _lastBackoffMs(0) {}
 
-void RegistrationPolicy::OnAttempt() {
-    _due.Clear();
-    _attemptMs = _clock.NowMs();
-}
+void RegistrationPolicy::OnAttempt() { _attemptMs = _clock.NowMs(); }
 
-int64_t RegistrationPolicy::OnStart() { return Arm(Jitter(_random, _rules.startSpreadMs)); }
+int64_t RegistrationPolicy::OnStart() { return Jitter(_random, _rules.startSpreadMs); }
 
 bool RegistrationPolicy::NeedsReload(RELAYD_RET err) {
     return err == RELAYD_ERR_AUTH || err == RELAYD_ERR_NOT_SUPPORT || err == RELAYD_ERR_API_KEY_EXPIRED ||
@@ -82,40 +73,33 @@ int64_t RegistrationPolicy::BackoffMs(int n) const {
     return _rules.failure.WaitMs(n, n > 1 ? _lastBackoffMs : 0, _random);
 }
 
-int64_t RegistrationPolicy::Arm(int64_t delayMs) {
-    _due.Arm(delayMs);
-    return delayMs;
-}
-
 int64_t RegistrationPolicy::OnFailure(RELAYD_RET err) {
     if (NeedsReload(err)) {
         _halted = true;
-        _due.Clear();
         return WAIT_FOR_RELOAD;
     }
     if (err == RELAYD_ERR_RESOLV && !_rules.resolveBacksOff) {
-        return Arm(_rules.resolveMs + Jitter(_random, _rules.resolveJitterMs));
+        return _rules.resolveMs + Jitter(_random, _rules.resolveJitterMs);
     }
     ++_failures;
     _lastBackoffMs = BackoffMs(_failures);
     if (_rules.fromAttemptStart && _attemptMs >= 0) {
-        return Arm(std::max<int64_t>(_attemptMs + _lastBackoffMs - _clock.NowMs(), 0));
+        return std::max<int64_t>(_attemptMs + _lastBackoffMs - _clock.NowMs(), 0);
     }
-    return Arm(_lastBackoffMs);
+    return _lastBackoffMs;
 }
 
 int64_t RegistrationPolicy::OnServerMoved() {
     ++_moves;
-    if (_moves == 1) return Arm(Jitter(_random, _rules.moveSpreadMs));
+    if (_moves == 1) return Jitter(_random, _rules.moveSpreadMs);
     _lastBackoffMs = BackoffMs(_moves - 1);
-    return Arm(_lastBackoffMs);
+    return _lastBackoffMs;
 }
 
 void RegistrationPolicy::OnSuccess() {
     _failures = 0;
     _moves = 0;
     _lastBackoffMs = 0;
-    _due.Clear();
 }
 
 void RegistrationPolicy::Reset() {
@@ -127,18 +111,12 @@ void RegistrationPolicy::Dump(Json::Value& out) const {
     out["failures"] = _failures;
     out["moves"] = _moves;
     out["halted"] = _halted;
-    out["retry_in_ms"] = static_cast<Json::Int64>(RemainingMs());
 }
 
 // ---- alias -------------------------------------------------------------------
 
-AliasPolicy::AliasPolicy(const Clock& clock, RandomSource random)
-    : _random(std::move(random)),
-      _due(clock),
-      _failures(0),
-      _halted(false),
-      _mapped(false),
-      _retryClass(-1) {}
+AliasPolicy::AliasPolicy(const Clock&, RandomSource random)
+    : _random(std::move(random)), _failures(0), _halted(false), _mapped(false), _retryClass(-1) {}
 
 int64_t AliasPolicy::NormalBackoffMs(int n, int pollSeconds) const {
     const int64_t cap = static_cast<int64_t>(std::max(pollSeconds, 60)) * 1000;
@@ -147,13 +125,11 @@ int64_t AliasPolicy::NormalBackoffMs(int n, int pollSeconds) const {
 }
 
 AliasStep AliasPolicy::Run(ALIAS_REQUEST_CMD cmd, int64_t delayMs, bool cleanDns) {
-    _due.Arm(delayMs);
     return AliasStep{true, cmd, delayMs, cleanDns};
 }
 
 AliasStep AliasPolicy::Halt() {
     _halted = true;
-    _due.Clear();
     return AliasStep{false, ALIAS_REQ_MAP, -1, false};
 }
 
@@ -197,7 +173,6 @@ void AliasPolicy::Reset() {
     _failures = 0;
     _halted = false;
     _mapped = false;
-    _due.Clear();
 }
 
 void AliasPolicy::Dump(Json::Value& out) const {
@@ -205,13 +180,12 @@ void AliasPolicy::Dump(Json::Value& out) const {
     out["failures"] = _failures;
     out["halted"] = _halted;
     out["mapped"] = _mapped;
-    out["next_in_ms"] = static_cast<Json::Int64>(RemainingMs());
 }
 
 // ---- tunnel ------------------------------------------------------------------
 
-TunnelPolicy::TunnelPolicy(const Clock& clock, RandomSource random, TunnelRules rules)
-    : _random(std::move(random)), _rules(rules), _due(clock), _failures(0), _lastBackoffMs(0) {}
+TunnelPolicy::TunnelPolicy(const Clock&, RandomSource random, TunnelRules rules)
+    : _random(std::move(random)), _rules(rules), _failures(0), _lastBackoffMs(0) {}
 
 int64_t TunnelPolicy::BackoffMs(int n) const {
     return _rules.failure.WaitMs(n, n > 1 ? _lastBackoffMs : 0, _random);
@@ -220,28 +194,22 @@ int64_t TunnelPolicy::BackoffMs(int n) const {
 int64_t TunnelPolicy::OnFailure() {
     ++_failures;
     _lastBackoffMs = BackoffMs(_failures);
-    _due.Arm(_lastBackoffMs);
     return _lastBackoffMs;
 }
 
 int64_t TunnelPolicy::OnClosed() {
     ++_failures;
     _lastBackoffMs = std::max<int64_t>(_rules.closedMs, 0) + Jitter(_random, _rules.closedSpreadMs);
-    _due.Arm(_lastBackoffMs);
     return _lastBackoffMs;
 }
 
 void TunnelPolicy::OnUp() {
     _failures = 0;
     _lastBackoffMs = 0;
-    _due.Clear();
 }
 
 void TunnelPolicy::Reset() { OnUp(); }
 
-void TunnelPolicy::Dump(Json::Value& out) const {
-    out["failures"] = _failures;
-    out["retry_in_ms"] = static_cast<Json::Int64>(RemainingMs());
-}
+void TunnelPolicy::Dump(Json::Value& out) const { out["failures"] = _failures; }
 
 }  // namespace zeparelayd

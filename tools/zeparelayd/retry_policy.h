@@ -1,6 +1,7 @@
 // When the daemon tries again. Each cycle owns one policy: it reports what an
 // exchange gave and gets back what to do next and after how long; the policy
-// keeps the counts and the deadline, and knows nothing of the network.
+// keeps the counts and knows nothing of the network nor of timers. The cycle
+// arms one loop timer per wait, and that timer alone says when it runs out.
 #ifndef ZEPARELAYD_TOOL_RETRY_POLICY_H
 #define ZEPARELAYD_TOOL_RETRY_POLICY_H
 
@@ -71,20 +72,6 @@ struct TunnelRules {
     int64_t closedSpreadMs = 300000;                           // ... plus up to this much
 };
 
-// A wait that was decided, and when it runs out.
-class Deadline {
-public:
-    explicit Deadline(const Clock& clock) : _clock(clock), _dueMs(-1) {}
-    void Arm(int64_t delayMs) { _dueMs = _clock.NowMs() + delayMs; }
-    void Clear() { _dueMs = -1; }
-    // -1 when nothing is due, else the milliseconds left (0 once passed).
-    int64_t RemainingMs() const;
-
-private:
-    const Clock& _clock;
-    int64_t _dueMs;
-};
-
 // Registration with the control server:
 //   - a failure is tried again 285 to 300 s after the failed attempt started,
 //     however long it hung and however long the relay has been away: about
@@ -112,7 +99,7 @@ public:
     // The wait before the first registration after the daemon starts.
     int64_t OnStart();
 
-    // An attempt starts now: nothing is due any more.
+    // An attempt starts now (a failure's wait counts from here).
     void OnAttempt();
     // After a failed attempt: the wait before the next one, or WAIT_FOR_RELOAD.
     int64_t OnFailure(ZEPA::Relay::RELAYD_RET err);
@@ -125,7 +112,7 @@ public:
     bool Halted() const { return _halted; }
     int Failures() const { return _failures; }
     int Moves() const { return _moves; }
-    int64_t RemainingMs() const { return _due.RemainingMs(); }
+    // "failures", "moves", "halted"; the cycle adds when the next attempt is due.
     void Dump(Json::Value& out) const;
 
     static bool NeedsReload(ZEPA::Relay::RELAYD_RET err);
@@ -134,12 +121,9 @@ public:
     int64_t BackoffMs(int n) const;
 
 private:
-    int64_t Arm(int64_t delayMs);
-
     const Clock& _clock;
     RandomSource _random;
     RegistrationRules _rules;
-    Deadline _due;
     int64_t _attemptMs;  // when the last attempt started, -1 before any
     int _failures;
     int _moves;
@@ -169,6 +153,8 @@ public:
     static constexpr int64_t RESOLVE_DELAY_MS = 20000;
     static constexpr int64_t RESOLVE_JITTER_MS = 10000;
 
+    // Every alias wait counts from the moment it is decided: the clock is
+    // not consulted (the parameter keeps the policies' constructors alike).
     AliasPolicy(const Clock& clock, RandomSource random);
 
     // After a (re)registration: map, or keep alive what is mapped already.
@@ -183,8 +169,6 @@ public:
     AliasStep OnNotStarted(ZEPA::Relay::ALIAS_REQUEST_CMD cmd, int pollSeconds);
     // The alias data is incomplete: nothing a retry would change.
     void OnIncompleteData() { Halt(); }
-    // An exchange starts now, or the cycle stops: nothing is due any more.
-    void OnAttempt() { _due.Clear(); }
     // A reload: everything starts afresh.
     void Reset();
 
@@ -192,7 +176,8 @@ public:
     bool Mapped() const { return _mapped; }
     int Failures() const { return _failures; }
     int RetryClass() const { return _retryClass; }
-    int64_t RemainingMs() const { return _due.RemainingMs(); }
+    // "retry_class", "failures", "halted", "mapped"; the cycle adds when the
+    // next exchange is due.
     void Dump(Json::Value& out) const;
 
     // The wait after the n-th consecutive normal failure (n >= 1), with jitter.
@@ -203,7 +188,6 @@ private:
     AliasStep Halt();
 
     RandomSource _random;
-    Deadline _due;
     int _failures;
     bool _halted;
     bool _mapped;  // mapped since the last (re)registration
@@ -221,6 +205,7 @@ private:
 // afresh.
 class TunnelPolicy {
 public:
+    // Like AliasPolicy, the clock is not consulted today.
     TunnelPolicy(const Clock& clock, RandomSource random, TunnelRules rules = TunnelRules());
 
     // A start failed: the wait before registering again.
@@ -228,12 +213,10 @@ public:
     // A tunnel that was up closed: the wait before registering again.
     int64_t OnClosed();
     void OnUp();
-    // Registering again now, or the cycle stops: nothing is due any more.
-    void OnAttempt() { _due.Clear(); }
     void Reset();
 
     int Failures() const { return _failures; }
-    int64_t RemainingMs() const { return _due.RemainingMs(); }
+    // "failures"; the cycle adds when the next registration is due.
     void Dump(Json::Value& out) const;
 
     // The wait for the n-th consecutive failure (n >= 1), with jitter.
@@ -242,7 +225,6 @@ public:
 private:
     RandomSource _random;
     TunnelRules _rules;
-    Deadline _due;
     int _failures;
     int64_t _lastBackoffMs;
 };

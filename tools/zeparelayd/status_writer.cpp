@@ -16,9 +16,11 @@
 #include "debug_dump.h"
 #include "log.h"
 #include "relay_daemon.h"
+#include "relayd_protocol.h"
 #include "systemd_notify.h"
 
 using namespace ZEPA::Relay;
+namespace key = zepatools::status_key;
 
 namespace zeparelayd {
 
@@ -29,6 +31,8 @@ void RelayDaemon::SetState(RELAYD_STATE state, RELAYD_RET error) {
     }
     _state = state;
     _error = error;
+    // An alias exchange that falls due while not registered is skipped.
+    _alias.SetRegistered(IsRegistered());
     // Written after the round (Idle), or at once when the loop has ended.
     if (!_loop.Running()) WriteStatus();
 }
@@ -53,35 +57,35 @@ Json::Value Since(const Json::Value& last, const char* key, bool same) {
 // the next attempt of each is due (null: none planned), for "doctor".
 void RelayDaemon::AddTimes(Json::Value& status) const {
     const Json::Value& last = _lastStatus;
-    const bool sameRegistration =
-        last.isObject() && last["state"] == status["state"] && last["error"] == status["error"];
-    status["registration_at"] = Since(last, "registration_at", sameRegistration);
-    const bool sameAlias = last.isObject() && last["alias_status"] == status["alias_status"];
-    status["alias_at"] = Since(last, "alias_at", sameAlias);
+    const bool sameRegistration = last.isObject() && last[key::kState] == status[key::kState] &&
+                                  last[key::kError] == status[key::kError];
+    status[key::kRegistrationAt] = Since(last, key::kRegistrationAt, sameRegistration);
+    const bool sameAlias = last.isObject() && last[key::kAliasStatus] == status[key::kAliasStatus];
+    status[key::kAliasAt] = Since(last, key::kAliasAt, sameAlias);
     Json::Value registration, alias;
     _registration.Dump(registration);
     _alias.Dump(alias);
-    status["registration_retry_at"] = DueAt(registration["retry_in_ms"]);
-    status["alias_retry_at"] = DueAt(alias["next_in_ms"]);
+    status[key::kRegistrationRetryAt] = DueAt(registration["retry_in_ms"]);
+    status[key::kAliasRetryAt] = DueAt(alias["next_in_ms"]);
 }
 
 void RelayDaemon::WriteStatus() {
     Json::Value status(Json::objectValue);
-    status["pid"] = static_cast<int>(getpid());
-    status["state"] = static_cast<int>(_state);
-    status["error"] = static_cast<int>(_error);
-    status["serverID"] = _conf->serverID;
-    _conf->WriteServices(status["service"], true);
-    status["alias"] = _conf->alias.GetAliasName();
-    status["alias_status"] = _alias.Word();
-    if (!_configError.empty()) status["config_error"] = _configError;
+    status[key::kPid] = static_cast<int>(getpid());
+    status[key::kState] = static_cast<int>(_state);
+    status[key::kError] = static_cast<int>(_error);
+    status[key::kServerId] = _conf->serverID;
+    _conf->WriteServices(status[key::kService], true);
+    status[key::kAlias] = _conf->alias.GetAliasName();
+    status[key::kAliasStatus] = _aliasWord;
+    if (!_configError.empty()) status[key::kConfigError] = _configError;
     const Json::Value connection = _tunnel.Status();
-    status["connect"] = connection["connect"];
-    if (connection.isMember("tunnel")) status["tunnel"] = connection["tunnel"];
+    status[key::kConnect] = connection[key::kConnect];
+    if (connection.isMember(key::kTunnel)) status[key::kTunnel] = connection[key::kTunnel];
     AddTimes(status);
     if (status == _lastStatus) return;
     if (RelaydConf::WriteJsonFile(Daemon::GetStatusPath(), status)) _lastStatus = status;
-    NotifyStatus(ServiceStatusLine(GetStateStr(_state), GetErrorStr(_error), _alias.Word()));
+    NotifyStatus(ServiceStatusLine(GetStateStr(_state), GetErrorStr(_error), _aliasWord));
 }
 
 Json::Value RelayDaemon::DebugDump() const {

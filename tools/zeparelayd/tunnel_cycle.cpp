@@ -9,7 +9,9 @@
 
 #include <cerrno>
 
+#include "link_watch.h"
 #include "log.h"
+#include "relayd_protocol.h"
 #include "server_answer.h"
 
 using namespace ZEPA::Relay;
@@ -43,17 +45,26 @@ void ResetSignalsForChild() {
 
 }  // namespace
 
-TunnelCycle::TunnelCycle(EventLoop& loop, const Clock& clock, Hooks hooks, RandomSource random)
+TunnelCycle::TunnelCycle(EventLoop& loop, const Clock& clock, OutcomeHandler onOutcome, RandomSource random)
     : _loop(loop),
       _clock(clock),
       _policy(clock, std::move(random)),
-      _hooks(std::move(hooks)),
+      _onOutcome(std::move(onOutcome)),
       _heartbeatSeconds(0),
       _upWaitMs(UP_WAIT_MS),
       _starting(false),
       _startDeferred(false),
       _startedMs(0),
       _linkDown(false) {}
+
+void TunnelCycle::Deliver(TunnelOutcome::Kind kind, RELAYD_RET error, int64_t retryMs) {
+    if (!_onOutcome) return;
+    TunnelOutcome outcome;
+    outcome.kind = kind;
+    outcome.error = error;
+    outcome.retryMs = retryMs;
+    _onOutcome(outcome);
+}
 
 bool TunnelCycle::IsUp() const {
     return _tunnel && !_starting && _tunnel->GetStatus() == TUNNEL_STATUS_READY && !_peer.empty() &&
@@ -63,7 +74,6 @@ bool TunnelCycle::IsUp() const {
 void TunnelCycle::OnRegistered(const Json::Value& answer) {
     _loop.CancelTimer(kHeartbeatTimer);
     _loop.CancelTimer(kRetryTimer);
-    _policy.OnAttempt();
     int beat = 0;
     _heartbeatSeconds = AnswerInt(answer, "heartbeat", beat) && beat > 0 ? beat : 0;
     _mode.clear();
@@ -75,11 +85,11 @@ void TunnelCycle::OnRegistered(const Json::Value& answer) {
             (_starting || (_tunnel->IsAlive() && _tunnel->GetStatus() == TUNNEL_STATUS_READY))) {
             // A heartbeat that changes nothing keeps the tunnel, or the start
             // under way.
-            _hooks.setState(IsUp() ? RELAYD_STATE_CONNECTED_ALT : RELAYD_STATE_CONNECTED, RELAYD_SUCCESS);
+            Deliver(IsUp() ? TunnelOutcome::UP : TunnelOutcome::REGISTERED);
         } else {
             Teardown(false);
             _tunnel.reset(new Tunnel(next));
-            _hooks.setState(RELAYD_STATE_CONNECTED, RELAYD_SUCCESS);
+            Deliver(TunnelOutcome::REGISTERED);
             // Opened from a timer, so that the state above is out first.
             _loop.SetTimer(kOpenTimer, 0, [this] { Open(); });
         }
@@ -90,8 +100,7 @@ void TunnelCycle::OnRegistered(const Json::Value& answer) {
         Teardown(false);
         _tunnel.reset();
         _policy.Reset();
-        _hooks.setState(_mode == "direct" ? RELAYD_STATE_DIRECT_CONNECT : RELAYD_STATE_CONNECTED,
-                        RELAYD_SUCCESS);
+        Deliver(_mode == "direct" ? TunnelOutcome::DIRECT : TunnelOutcome::REGISTERED);
     }
     ScheduleHeartbeat();
 }
@@ -100,7 +109,7 @@ void TunnelCycle::ScheduleHeartbeat() {
     if (_heartbeatSeconds <= 0) return;
     _loop.SetTimer(kHeartbeatTimer, static_cast<int64_t>(_heartbeatSeconds) * 1000, [this] {
         RLOG(LOG_DEBUG, "heartbeat: registering again");
-        _hooks.reregister();
+        Deliver(TunnelOutcome::REGISTER_AGAIN);
     });
 }
 
@@ -118,6 +127,7 @@ void TunnelCycle::Open() {
     _tunnel->pid = -1;
     _starting = true;
     _linkDown = false;
+    _link.Stop();
     _peer.clear();
     _protocols = {"udp", "tcp"};
     _startedMs = _clock.NowMs();
@@ -185,7 +195,7 @@ void TunnelCycle::OnUpSignal() {
         if (_linkDown) {
             _linkDown = false;
             RLOG(LOG_NOTICE, "tunnel to [%s] is back, peer [%s]", _tunnel->relay_ip.c_str(), peer.c_str());
-            _hooks.setState(RELAYD_STATE_CONNECTED_ALT, RELAYD_SUCCESS);
+            Deliver(TunnelOutcome::UP);
         }
     }
 }
@@ -222,26 +232,34 @@ void TunnelCycle::Up(const std::string& peer) {
     _tunnel->status = TUNNEL_STATUS_READY;
     _peer = peer;
     _policy.OnUp();
+    _link.Start(_tunnel->pid, _tunnel->relay_ip);
     RLOG(LOG_NOTICE, "tunnel up in %lld ms over %s, pid %d, peer [%s]",
          static_cast<long long>(_clock.NowMs() - _startedMs), _protocol.c_str(), _tunnel->pid, _peer.c_str());
-    _hooks.setState(RELAYD_STATE_CONNECTED_ALT, RELAYD_SUCCESS);
+    Deliver(TunnelOutcome::UP);
     _loop.SetTimer(kLinkTimer, LINK_CHECK_MS, [this] { CheckLink(); });
 }
 
 // The down script removes the peer address when openvpn loses its link and
-// restarts; the up script writes it again once the link is back.
+// restarts; the up script writes it again once the link is back. A link that
+// goes down (no route to the relay, or its device without carrier) is seen
+// at once, long before openvpn's ping timeout; it is back when the way is.
 void TunnelCycle::CheckLink() {
     if (!_tunnel || _starting || _tunnel->GetStatus() != TUNNEL_STATUS_READY) return;
     const std::string peer = Tunnel::GetVpnTunnelPeerIp();
-    if (peer.empty() && !_linkDown) {
+    const bool noWay = _link.Check() == LinkWatch::DOWN;
+    if ((peer.empty() || noWay) && !_linkDown) {
         _linkDown = true;
-        RLOG(LOG_WARNING, "tunnel to [%s] lost its link: openvpn reconnects", _tunnel->relay_ip.c_str());
-        _hooks.setState(RELAYD_STATE_CONNECTED, RELAYD_ERR_NETWORK);
-    } else if (!peer.empty() && _linkDown) {
+        if (noWay) {
+            RLOG(LOG_WARNING, "tunnel to [%s] lost its link: no way to the relay", _tunnel->relay_ip.c_str());
+        } else {
+            RLOG(LOG_WARNING, "tunnel to [%s] lost its link: openvpn reconnects", _tunnel->relay_ip.c_str());
+        }
+        Deliver(TunnelOutcome::LINK_LOST, RELAYD_ERR_NETWORK);
+    } else if (!peer.empty() && !noWay && _linkDown) {
         _linkDown = false;
         _peer = peer;
         RLOG(LOG_NOTICE, "tunnel to [%s] is back, peer [%s]", _tunnel->relay_ip.c_str(), peer.c_str());
-        _hooks.setState(RELAYD_STATE_CONNECTED_ALT, RELAYD_SUCCESS);
+        Deliver(TunnelOutcome::UP);
     }
     _loop.SetTimer(kLinkTimer, LINK_CHECK_MS, [this] { CheckLink(); });
 }
@@ -251,11 +269,8 @@ void TunnelCycle::Failed(RELAYD_RET error, bool wasUp) {
     const int64_t delay = wasUp ? _policy.OnClosed() : _policy.OnFailure();
     RLOG(LOG_INFO, "tunnel retry %d in %lld ms", _policy.Failures(), static_cast<long long>(delay));
     _loop.CancelTimer(kHeartbeatTimer);
-    _hooks.setState(RELAYD_STATE_LOGIN, error);
-    _loop.SetTimer(kRetryTimer, delay, [this] {
-        _policy.OnAttempt();
-        _hooks.reregister();
-    });
+    _loop.SetTimer(kRetryTimer, delay, [this] { Deliver(TunnelOutcome::REGISTER_AGAIN); });
+    Deliver(TunnelOutcome::FAILED, error, delay);
 }
 
 // True once the child is gone (reaped here, or by someone else before).
@@ -322,6 +337,7 @@ void TunnelCycle::Teardown(bool waitForChild) {
     _loop.CancelTimer(kOpenTimer);
     _loop.CancelTimer(kUpWaitTimer);
     _loop.CancelTimer(kLinkTimer);
+    _link.Stop();
     _peer.clear();
     _linkDown = false;
     _starting = false;
@@ -365,16 +381,17 @@ void TunnelCycle::Teardown(bool waitForChild) {
 }
 
 Json::Value TunnelCycle::Status() const {
+    namespace key = zepatools::status_key;
     Json::Value out(Json::objectValue);
-    out["connect"] = _mode;
+    out[key::kConnect] = _mode;
     if (!_tunnel) return out;
-    Json::Value& tunnel = out["tunnel"];
+    Json::Value& tunnel = out[key::kTunnel];
     _tunnel->Write(tunnel, true);
     // Up only while a peer address is known: a reconnecting openvpn is not.
-    if (_linkDown) tunnel["status"] = Tunnel::GetStatusStr(TUNNEL_STATUS_NONE);
-    tunnel["peer_ip"] = _peer;
-    tunnel["failures"] = _policy.Failures();
-    if (_starting) tunnel["starting"] = _protocol;
+    if (_linkDown) tunnel[key::kTunnelStatus] = Tunnel::GetStatusStr(TUNNEL_STATUS_NONE);
+    tunnel[key::kTunnelPeerIp] = _peer;
+    tunnel[key::kTunnelFailures] = _policy.Failures();
+    if (_starting) tunnel[key::kTunnelStarting] = _protocol;
     // Never shown, whatever Write does with the section in the future.
     tunnel.removeMember("relay_pass");
     return out;
@@ -388,6 +405,7 @@ void TunnelCycle::Dump(Json::Value& out) const {
     out["up_wait_ms"] = static_cast<Json::Int64>(_loop.TimerRemaining(kUpWaitTimer));
     out["ending"] = static_cast<Json::UInt>(_ending.size());
     _policy.Dump(out["retry"]);
+    out["retry"]["retry_in_ms"] = static_cast<Json::Int64>(_loop.TimerRemaining(kRetryTimer));
 }
 
 }  // namespace zeparelayd

@@ -16,12 +16,17 @@
 // The tunnel counts as up only once the up script has published a peer
 // address; a child still running without one after the wait is ended and the
 // attempt counts as failed. A tunnel whose peer address disappears (openvpn
-// restarting its connection after a link loss) is shown as state 5 until the
-// up script reports again. A tunnel that fails to start or closes later is
-// torn down, the state is 3 with "err_network", and the daemon registers again
-// after TunnelPolicy's wait (0 to 5 minutes after a close, 2 s doubling after a
-// failed start), which also fetches fresh credentials. "heartbeat": N in the answer registers again after N
-// seconds.
+// restarting its connection after a link loss), or whose way to the relay
+// goes (no route, or no carrier: link_watch.h), is shown as state 5 with
+// "err_network" until the up script reports again or the way is back. A
+// tunnel that fails to start or closes later is torn down, the state is 3
+// with "err_network", and the daemon registers again after TunnelPolicy's
+// wait (0 to 5 minutes after a close, 2 s doubling after a failed start),
+// which also fetches fresh credentials. "heartbeat": N in the answer registers
+// again after N seconds.
+//
+// The cycle reports each of these as a TunnelOutcome; the daemon makes the
+// state of it and starts the registration when asked to.
 #ifndef ZEPARELAYD_TOOL_TUNNEL_CYCLE_H
 #define ZEPARELAYD_TOOL_TUNNEL_CYCLE_H
 
@@ -40,9 +45,26 @@
 
 #include "clock.h"
 #include "event_loop.h"
+#include "link_watch.h"
 #include "retry_policy.h"
 
 namespace zeparelayd {
+
+// What the way the appliance is reached came to.
+struct TunnelOutcome {
+    enum Kind {
+        DIRECT,          // reached directly, no tunnel (state 4)
+        REGISTERED,      // registered only, or a tunnel on its way (state 5)
+        UP,              // the tunnel carries traffic (state 6)
+        LINK_LOST,       // openvpn reconnects after losing its link (state 5, "err_network")
+        FAILED,          // the tunnel failed to open or closed (state 3); error says why,
+                         // retryMs when the daemon registers again
+        REGISTER_AGAIN,  // heartbeat or reconnection due: register now
+    };
+    Kind kind = REGISTERED;
+    ZEPA::Relay::RELAYD_RET error = ZEPA::Relay::RELAYD_SUCCESS;
+    int64_t retryMs = -1;
+};
 
 class TunnelCycle {
 public:
@@ -53,14 +75,9 @@ public:
     // How often a tunnel that is up is checked for its peer address.
     static constexpr int64_t LINK_CHECK_MS = 1000;
 
-    struct Hooks {
-        std::function<void(ZEPA::Relay::RELAYD_STATE, ZEPA::Relay::RELAYD_RET)> setState;
-        // Register with the control server again (heartbeat, or reconnection
-        // once the back-off has passed).
-        std::function<void()> reregister;
-    };
+    using OutcomeHandler = std::function<void(const TunnelOutcome&)>;
 
-    TunnelCycle(EventLoop& loop, const Clock& clock, Hooks hooks, RandomSource random);
+    TunnelCycle(EventLoop& loop, const Clock& clock, OutcomeHandler onOutcome, RandomSource random);
 
     // Tests shorten the wait for the up script.
     void SetUpWaitMs(int64_t ms) { _upWaitMs = ms; }
@@ -100,6 +117,8 @@ private:
     void CheckLink();
     // wasUp: the tunnel had come up and closed, rather than failed to start.
     void Failed(ZEPA::Relay::RELAYD_RET error, bool wasUp = false);
+    void Deliver(TunnelOutcome::Kind kind, ZEPA::Relay::RELAYD_RET error = ZEPA::Relay::RELAYD_SUCCESS,
+                 int64_t retryMs = -1);
     void ScheduleHeartbeat();
     void Teardown(bool waitForChild);
     void EndChild(pid_t pid);
@@ -109,7 +128,7 @@ private:
     EventLoop& _loop;
     const Clock& _clock;
     TunnelPolicy _policy;
-    Hooks _hooks;
+    OutcomeHandler _onOutcome;
     std::string _mode;  // "direct", "tunnel" or empty, from the last answer
     std::unique_ptr<ZEPA::Relay::Tunnel> _tunnel;
     std::string _peer;
@@ -123,6 +142,7 @@ private:
     std::string _passFile;
     int64_t _startedMs;
     bool _linkDown;
+    LinkWatch _link;  // the way to the relay while up
     std::set<pid_t> _ending;
 };
 
