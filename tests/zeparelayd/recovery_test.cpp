@@ -76,15 +76,18 @@ protected:
         close(fds[1]);
         waitpid(middle, nullptr, 0);
         started.push_back(child);
-        // Until it runs the script, its command name is not yet "openvpn".
-        for (int i = 0; i < 200; ++i) {
+        // Until it runs the script, its command name is not yet "openvpn"
+        // (a loaded machine can take seconds to get there).
+        std::string name;
+        for (int i = 0; i < 1000 && name != "openvpn"; ++i) {
             std::ifstream comm("/proc/" + std::to_string(child) + "/comm");
-            std::string name;
+            name.clear();
             comm >> name;
             if (name == "openvpn") break;
             struct timespec ts = {0, 10 * 1000000L};
             nanosleep(&ts, nullptr);
         }
+        EXPECT_EQ("openvpn", name) << "the stand-in openvpn " << child << " did not start within 10 s";
         return child;
     }
     static bool Alive(pid_t pid) {
